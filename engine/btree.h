@@ -1,0 +1,181 @@
+// The storage engine binding: the ordered B-tree operations the store is
+// built on, implemented over SQLite's public C API on one private
+// connection.
+//
+// What this layer promises (each rule has its own test in
+// tests/engine_test.cpp):
+//
+//  1. Key order. Byte-string keys compare bytewise unsigned over the shorter
+//     length, then the shorter key first. Integer keys compare as signed
+//     64-bit numbers.
+//  2. sqlite3BtreeMoveto leaves the cursor next to the sought key and says
+//     where: 0 = on an entry equal to the key; negative = on the largest
+//     entry smaller than the key (or on no entry when the table is empty);
+//     positive = on the smallest entry larger than the key. This binding
+//     lands on the larger neighbour whenever one exists. A null key pointer
+//     on a byte-string table is refused with SQLITE_CORRUPT.
+//  3. First/Last set their flag to 1 only for an empty table. Next/Previous
+//     set it to 1 when there was no following/preceding entry, or when the
+//     cursor was on no entry; the cursor is then on no entry. A flag is not
+//     written when the call fails.
+//  4. sqlite3BtreeEof is nonzero in every state other than "on an entry".
+//  5. sqlite3BtreeKey on an integer-keyed table is refused with
+//     SQLITE_CORRUPT. A Key or Data read whose offset plus amount goes past
+//     the entry (key plus data for Key, data for Data) is refused with
+//     SQLITE_ERROR. Refused reads write nothing. A Key read longer than the
+//     key continues into the data bytes.
+//  6. sqlite3BtreeInsert replaces an entry with an equal key, key and data
+//     together, or adds a new one. Afterwards every cursor on that table,
+//     the inserting one included, is on no entry until it is moved again.
+//  7. An insert through a cursor opened without the write flag is refused
+//     with SQLITE_PERM.
+//  8. While any read cursor (write flag 0) is open on a table, opening a
+//     writing cursor on it is refused with SQLITE_LOCKED (the out-pointer
+//     receives null), and so is an insert into it.
+//  9. CreateTable and DropTable are refused with SQLITE_LOCKED while any
+//     cursor is open on the handle, and with SQLITE_ERROR when no write
+//     transaction is active. Inserts and writing cursors need the write
+//     transaction as well.
+// 10. SetPageSize accepts a power of two from 512 to 32768, and only before
+//     the database's first page is fixed (a write transaction or a table
+//     fixes it): afterwards SQLITE_READONLY.
+// 11. KeySize and DataSize report 0 for a cursor on no entry.
+//
+// Handles. Every operation tolerates a null engine or cursor handle: it
+// returns SQLITE_MISUSE and writes no out-value. Closing the engine
+// finalizes all of its statements and leaves each of its cursors as an
+// inert object that answers "no entry" (reads refused, moves report no
+// entry) until it is itself closed with sqlite3BtreeCloseCursor, which
+// frees it. So a cursor handle stays safe to pass around for as long as it
+// has not been closed, whatever happened to its engine.
+//
+// Threads: an engine handle and its cursors are used from one thread at a
+// time; nothing here takes a lock.
+//
+// Refusals leave every state as it was. Failures reported by SQLite itself
+// (I/O errors, a full disk, out of memory) are returned as its result code;
+// a cursor whose step failed is left on no entry.
+#ifndef KOVPAGER_ENGINE_BTREE_H
+#define KOVPAGER_ENGINE_BTREE_H
+
+// Include this header before <sqlite3.h> where both are needed: the result
+// codes below share SQLite's macro names and values.
+#include <cstdint>
+
+struct sqlite3;
+
+namespace kov::engine {
+
+struct Btree;     // one private connection holding one temporary database
+struct BtCursor;  // a position in one table
+
+// Result codes, with SQLite's values.
+enum : int {
+    SQLITE_OK = 0,
+    SQLITE_ERROR = 1,
+    SQLITE_PERM = 3,
+    SQLITE_LOCKED = 6,
+    SQLITE_NOMEM = 7,
+    SQLITE_READONLY = 8,
+    SQLITE_IOERR = 10,
+    SQLITE_CORRUPT = 11,
+    SQLITE_FULL = 13,
+    SQLITE_TOOBIG = 18,
+    SQLITE_MISUSE = 21,
+};
+
+// Table flags for sqlite3BtreeCreateTable. The store uses 0 (byte-string
+// key with data), BTREE_INTKEY | BTREE_LEAFDATA (integer key with data) and
+// BTREE_ZERODATA (byte-string key only).
+enum : int {
+    BTREE_INTKEY = 1,
+    BTREE_ZERODATA = 2,
+    BTREE_LEAFDATA = 4,
+};
+
+// Open flags for sqlite3BtreeOpen.
+enum : int {
+    BTREE_OMIT_JOURNAL = 1,
+    BTREE_NO_READLOCK = 2,
+};
+
+// Comparison callback type of sqlite3BtreeCursor. Only null (the default
+// byte order) is supported; any other value is refused with SQLITE_MISUSE.
+using BtreeCompare = int (*)(void*, int, const void*, int, const void*);
+
+// The engine's temporary-directory setting (SQLite's global of that name).
+// Whoever opens the engine points it at a buffer that outlives the engine;
+// this binding only reads it, through SQLite.
+char*& temporaryDirectorySetting();
+
+// Opens a private temporary database on disk (no file name: the file is
+// created in the temporary directory when the cache first spills and is
+// deleted on close). `filename` must be null and `db` must be null.
+// flags: BTREE_OMIT_JOURNAL = no rollback journal; BTREE_NO_READLOCK = no
+// read locks (the file is held exclusively). Writes the handle to
+// *ppBtree, or null on failure.
+int sqlite3BtreeOpen(const char* filename, sqlite3* db, Btree** ppBtree, int flags);
+
+// Closes the engine: every statement is finalized, the transaction is
+// discarded, the temporary file is deleted, and every cursor still open
+// becomes inert (see above). The handle is freed.
+int sqlite3BtreeClose(Btree* p);
+
+// Page-cache size in pages (values below 10 count as 10).
+int sqlite3BtreeSetCacheSize(Btree* p, int pages);
+
+// Page size and reserved bytes per page (-1 keeps the current reserve).
+int sqlite3BtreeSetPageSize(Btree* p, int pageSize, int reserve);
+
+// Begins a transaction: write flag 0 = read, 1 = write, above 1 = write
+// with the exclusive lock taken at once. Never committed by the store.
+int sqlite3BtreeBeginTrans(Btree* p, int wrflag);
+
+// Creates an empty table with the given flags and writes its root page.
+int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags);
+
+// Drops the table whose root page is given; *piMoved receives 0 (no page is
+// ever relocated). Dropping a page that names no table is SQLITE_ERROR.
+int sqlite3BtreeDropTable(Btree* p, std::uint32_t iTable, int* piMoved);
+
+// Opens a cursor on the table with the given root page (refused with
+// SQLITE_ERROR when no table has that root). wrFlag 1 = a writing cursor.
+// *ppCur receives the handle, or null when refused.
+int sqlite3BtreeCursor(Btree* p, std::uint32_t iTable, int wrFlag, BtreeCompare xCmp,
+                       void* pArg, BtCursor** ppCur);
+
+// Closes and frees a cursor (inert ones included).
+int sqlite3BtreeCloseCursor(BtCursor* pCur);
+
+int sqlite3BtreeFirst(BtCursor* pCur, int* pRes);
+int sqlite3BtreeLast(BtCursor* pCur, int* pRes);
+int sqlite3BtreeNext(BtCursor* pCur, int* pRes);
+int sqlite3BtreePrevious(BtCursor* pCur, int* pRes);
+int sqlite3BtreeEof(BtCursor* pCur);
+
+// pKey/nKey: the key bytes and their length on byte-string tables; on
+// integer-keyed tables pKey is null and nKey is the integer key itself.
+int sqlite3BtreeMoveto(BtCursor* pCur, const void* pKey, std::int64_t nKey, int* pRes);
+
+// The key's length in bytes, or the integer key itself on an
+// integer-keyed table; 0 on no entry.
+int sqlite3BtreeKeySize(BtCursor* pCur, std::int64_t* pSize);
+
+// Copies amt bytes of key-then-data, from offset, into pBuf.
+int sqlite3BtreeKey(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, void* pBuf);
+
+// The data's length in bytes; 0 on no entry.
+int sqlite3BtreeDataSize(BtCursor* pCur, std::uint32_t* pSize);
+
+// Copies amt bytes of the data, from offset, into pBuf.
+int sqlite3BtreeData(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, void* pBuf);
+
+// Inserts or replaces one entry. pKey/nKey as for Moveto. pData may be null
+// only when nData is 0; a negative nData is refused with SQLITE_ERROR. On a
+// key-only table the data is not stored.
+int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, const void* pData,
+                       int nData);
+
+}  // namespace kov::engine
+
+#endif  // KOVPAGER_ENGINE_BTREE_H
