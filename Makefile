@@ -42,3 +42,6 @@ install: build
 
 clean:
 	rm -rf $(BUILD)
+
+# The Windows build (cross-compiled, tested under Wine) lives in its own file.
+-include cmake/windows.mk

@@ -31,23 +31,26 @@
 //     with SQLITE_PERM.
 //  8. While any read cursor (write flag 0) is open on a table, opening a
 //     writing cursor on it is refused with SQLITE_LOCKED (the out-pointer
-//     receives null), and so is an insert into it.
+//     receives null), and so is an insert into it. Opening a cursor never
+//     moves another one.
 //  9. CreateTable and DropTable are refused with SQLITE_LOCKED while any
 //     cursor is open on the handle, and with SQLITE_ERROR when no write
-//     transaction is active. Inserts and writing cursors need the write
-//     transaction as well.
+//     transaction is active. Inserts need the write transaction as well
+//     (SQLITE_ERROR otherwise); reads do not.
 // 10. SetPageSize accepts a power of two from 512 to 32768, and only before
 //     the database's first page is fixed (a write transaction or a table
 //     fixes it): afterwards SQLITE_READONLY.
 // 11. KeySize and DataSize report 0 for a cursor on no entry.
 //
 // Handles. Every operation tolerates a null engine or cursor handle: it
-// returns SQLITE_MISUSE and writes no out-value. Closing the engine
-// finalizes all of its statements and leaves each of its cursors as an
-// inert object that answers "no entry" (reads refused, moves report no
-// entry) until it is itself closed with sqlite3BtreeCloseCursor, which
-// frees it. So a cursor handle stays safe to pass around for as long as it
-// has not been closed, whatever happened to its engine.
+// returns SQLITE_MISUSE and writes no out-value (sqlite3BtreeEof answers
+// 1). Closing the engine finalizes all of its statements and leaves each
+// of its cursors as an inert object that answers like a cursor on an empty
+// table (moves report no entry, sizes are 0, reads past nothing are
+// refused, inserts are refused with SQLITE_MISUSE) until it is itself
+// closed with sqlite3BtreeCloseCursor, which frees it. So a cursor handle
+// stays safe to use for as long as it has not been closed, whatever
+// happened to its engine.
 //
 // Threads: an engine handle and its cursors are used from one thread at a
 // time; nothing here takes a lock.
@@ -124,7 +127,8 @@ int sqlite3BtreeClose(Btree* p);
 // Page-cache size in pages (values below 10 count as 10).
 int sqlite3BtreeSetCacheSize(Btree* p, int pages);
 
-// Page size and reserved bytes per page (-1 keeps the current reserve).
+// Page size and reserved bytes per page (-1 keeps the current reserve,
+// otherwise 0 to 255). An invalid page size is refused with SQLITE_ERROR.
 int sqlite3BtreeSetPageSize(Btree* p, int pageSize, int reserve);
 
 // Begins a transaction: write flag 0 = read, 1 = write, above 1 = write
@@ -175,6 +179,10 @@ int sqlite3BtreeData(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, vo
 // key-only table the data is not stored.
 int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, const void* pData,
                        int nData);
+
+// Test seam: the SQLite connection behind an engine handle (null for a
+// null handle), so tests can look at its settings and its file.
+sqlite3* TEST_connection(Btree* p);
 
 }  // namespace kov::engine
 
