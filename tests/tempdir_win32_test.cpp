@@ -1,0 +1,277 @@
+// Temporary-directory resolution on Windows: %KOV_TEMP%, %TEMP%, %TMP%, the local application-data
+// folder + "/Temp", "c:/temp", "c:/tmp"; bare drives, native form with backslashes.
+//
+// Each test starts with a fresh cache and with the three variables unset, and puts them back
+// afterwards. The environment is changed under the module's environment lock held exclusively.
+#include <gtest/gtest.h>
+
+// windows.h first: shlobj.h needs its types.
+#include <windows.h>
+
+#include <shlobj.h>
+#include <stdlib.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <random>
+#include <shared_mutex>
+#include <string>
+#include <vector>
+
+#include "tempdir/TempDirectory.h"
+#include "tempdir/TempDirectoryCache.h"
+#include "tempdir/TempDirectorySearch.h"
+
+namespace fs = std::filesystem;
+
+namespace {
+
+using kov::TempDirectoryCandidate;
+
+const char* const kVariables[] = {"KOV_TEMP", "TEMP", "TMP"};
+
+void setVariable(const std::string& name, const std::string& value) {
+    std::unique_lock<std::shared_mutex> lock(kov::environmentMutex());
+    ASSERT_EQ(::_putenv_s(name.c_str(), value.c_str()), 0);
+}
+
+// An empty value removes the variable.
+void unsetVariable(const std::string& name) {
+    setVariable(name, "");
+}
+
+bool isDirectory(const std::string& path) {
+    const DWORD attributes = ::GetFileAttributesA(path.c_str());
+    return attributes != INVALID_FILE_ATTRIBUTES && (attributes & FILE_ATTRIBUTE_DIRECTORY) != 0;
+}
+
+bool existsAtAll(const std::string& path) {
+    return ::GetFileAttributesA(path.c_str()) != INVALID_FILE_ATTRIBUTES;
+}
+
+std::string forwardSlashes(std::string path) {
+    for (char& c : path) {
+        if (c == '\\') {
+            c = '/';
+        }
+    }
+    return path;
+}
+
+// A drive letter with no drive behind it, or 'Q' when every letter is taken.
+char absentDrive() {
+    const DWORD drives = ::GetLogicalDrives();
+    for (char letter = 'Q'; letter <= 'Z'; ++letter) {
+        if ((drives & (1u << (letter - 'A'))) == 0) {
+            return letter;
+        }
+    }
+    return 'Q';
+}
+
+class TempDirWin32Test : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        for (const char* name : kVariables) {
+            if (const char* value = std::getenv(name)) {
+                saved_[name] = value;
+            }
+        }
+        char folder[MAX_PATH + 1] = {};
+        const DWORD length = ::GetTempPathA(sizeof folder, folder);
+        ASSERT_GT(length, 0u);
+        std::random_device random;
+        base_ = std::string(folder, length);
+        while (!base_.empty() && (base_.back() == '\\' || base_.back() == '/')) {
+            base_.pop_back();
+        }
+        base_ += "\\kov_tempdir_win32_test_" + std::to_string(random());
+        ASSERT_TRUE(::CreateDirectoryA(base_.c_str(), nullptr) != 0) << base_;
+        for (const char* name : kVariables) {
+            unsetVariable(name);
+        }
+        kov::tempDirectoryCache().TEST_reset();
+    }
+
+    void TearDown() override {
+        for (const char* name : kVariables) {
+            auto found = saved_.find(name);
+            setVariable(name, found != saved_.end() ? found->second : std::string());
+        }
+        kov::tempDirectoryCache().TEST_reset();
+        std::error_code ignored;
+        fs::remove_all(base_, ignored);
+    }
+
+    // A path under the scratch directory in native form (backslashes).
+    std::string at(const std::string& relative) const { return base_ + "\\" + relative; }
+
+    std::string makeDirectory(const std::string& relative) const {
+        const std::string path = at(relative);
+        std::error_code ignored;
+        fs::create_directories(path, ignored);
+        EXPECT_TRUE(isDirectory(path)) << path;
+        return path;
+    }
+
+    std::string makeFile(const std::string& relative) const {
+        const std::string path = at(relative);
+        std::ofstream out(path);
+        out << "not a directory";
+        EXPECT_TRUE(out.good()) << path;
+        return path;
+    }
+
+    static std::string source() { return kov::tempDirectoryCache().source(); }
+
+    std::string base_;
+    std::map<std::string, std::string> saved_;
+};
+
+// ---- the fixed list ----
+
+TEST(TempDirWin32Candidates, FixedListInOrder) {
+    const std::vector<TempDirectoryCandidate> list = kov::tempDirectoryCandidates();
+    ASSERT_EQ(list.size(), 6u);
+    EXPECT_EQ(list[0].kind, TempDirectoryCandidate::Kind::variable);
+    EXPECT_EQ(list[0].text, "KOV_TEMP");
+    EXPECT_EQ(list[1].kind, TempDirectoryCandidate::Kind::variable);
+    EXPECT_EQ(list[1].text, "TEMP");
+    EXPECT_EQ(list[2].kind, TempDirectoryCandidate::Kind::variable);
+    EXPECT_EQ(list[2].text, "TMP");
+    EXPECT_EQ(list[3].kind, TempDirectoryCandidate::Kind::located);
+    EXPECT_EQ(list[4].kind, TempDirectoryCandidate::Kind::fixed);
+    EXPECT_EQ(list[4].text, "c:/temp");
+    EXPECT_EQ(list[5].kind, TempDirectoryCandidate::Kind::fixed);
+    EXPECT_EQ(list[5].text, "c:/tmp");
+}
+
+TEST(TempDirWin32Candidates, SlashAndBackslashAreSeparators) {
+    EXPECT_EQ(kov::tempDirectorySeparators(), "/\\");
+}
+
+TEST(TempDirWin32Candidates, LocalAppDataCandidateIsTheShellFolderPlusTemp) {
+    char folder[MAX_PATH] = {};
+    ASSERT_EQ(::SHGetFolderPathA(nullptr, CSIDL_LOCAL_APPDATA, nullptr, SHGFP_TYPE_CURRENT, folder),
+              S_OK);
+    const std::vector<TempDirectoryCandidate> list = kov::tempDirectoryCandidates();
+    ASSERT_EQ(list.size(), 6u);
+    ASSERT_TRUE(static_cast<bool>(list[3].locate));
+    const std::optional<std::string> located = list[3].locate();
+    ASSERT_TRUE(located.has_value());
+    EXPECT_EQ(*located, std::string(folder) + "/Temp");
+}
+
+// ---- the environment variables ----
+
+TEST_F(TempDirWin32Test, KovTempWinsAndIsTheSource) {
+    const std::string kov = makeDirectory("kov");
+    setVariable("KOV_TEMP", kov);
+    setVariable("TEMP", makeDirectory("temp"));
+    setVariable("TMP", makeDirectory("tmp"));
+    EXPECT_EQ(kov::getTempDirectory(), kov);
+    EXPECT_EQ(source(), "KOV_TEMP");
+}
+
+TEST_F(TempDirWin32Test, KovTempNamingAFileOrAMissingDirectoryIsSkipped) {
+    const std::string temp = makeDirectory("temp");
+    setVariable("KOV_TEMP", makeFile("plain"));
+    setVariable("TEMP", at("missing"));
+    setVariable("TMP", temp);
+    EXPECT_EQ(kov::getTempDirectory(), temp);
+    EXPECT_EQ(source(), "TMP");
+    EXPECT_FALSE(existsAtAll(at("missing")));
+}
+
+TEST_F(TempDirWin32Test, ForwardSlashesAndATrailingSlashComeBackWithBackslashes) {
+    // D:/scratch/ gives D:\scratch; here on the scratch directory's own drive.
+    const std::string scratch = makeDirectory("scratch");
+    setVariable("KOV_TEMP", forwardSlashes(scratch) + "/");
+    EXPECT_EQ(kov::getTempDirectory(), scratch);
+    EXPECT_EQ(source(), "KOV_TEMP");
+}
+
+TEST_F(TempDirWin32Test, DoubledSeparatorsAreCollapsed) {
+    const std::string inner = makeDirectory("a\\b");
+    setVariable("TEMP", forwardSlashes(base_) + "//a\\\\b\\");
+    EXPECT_EQ(kov::getTempDirectory(), inner);
+    EXPECT_EQ(source(), "TEMP");
+}
+
+TEST_F(TempDirWin32Test, BareDriveCountsAsExistingAndIsPublishedWithoutBackslash) {
+    const std::string drive = std::string(1, absentDrive()) + ":";
+    setVariable("KOV_TEMP", drive);
+    EXPECT_EQ(kov::getTempDirectory(), drive);
+    EXPECT_EQ(source(), "KOV_TEMP");
+}
+
+TEST_F(TempDirWin32Test, BareDriveWithBackslashIsPublishedAsTheDriveAlone) {
+    const std::string drive = std::string(1, absentDrive()) + ":";
+    setVariable("TEMP", drive + "\\");
+    EXPECT_EQ(kov::getTempDirectory(), drive);
+    EXPECT_EQ(source(), "TEMP");
+}
+
+TEST_F(TempDirWin32Test, ASingleDotIsPublishedAsADot) {
+    setVariable("KOV_TEMP", ".");
+    EXPECT_EQ(kov::getTempDirectory(), ".");
+    EXPECT_EQ(source(), "KOV_TEMP");
+}
+
+TEST_F(TempDirWin32Test, OnlySeparatorsValueIsSkipped) {
+    const std::string tmp = makeDirectory("tmp");
+    setVariable("KOV_TEMP", "\\");
+    setVariable("TEMP", "/\\/");
+    setVariable("TMP", tmp);
+    EXPECT_EQ(kov::getTempDirectory(), tmp);
+    EXPECT_EQ(source(), "TMP");
+}
+
+TEST_F(TempDirWin32Test, LocalAppDataTempWinsWhenNoVariableIsUsable) {
+    char folder[MAX_PATH] = {};
+    ASSERT_EQ(::SHGetFolderPathA(nullptr, CSIDL_LOCAL_APPDATA, nullptr, SHGFP_TYPE_CURRENT, folder),
+              S_OK);
+    const std::string expected = std::string(folder) + "\\Temp";
+    if (!isDirectory(expected)) {
+        ASSERT_TRUE(::CreateDirectoryA(expected.c_str(), nullptr) != 0) << expected;
+    }
+    setVariable("KOV_TEMP", at("missing"));
+    EXPECT_EQ(kov::getTempDirectory(), expected);
+    EXPECT_EQ(source(), "");
+}
+
+TEST_F(TempDirWin32Test, FixedFallbacksAreCTempThenCTmpInNativeForm) {
+    // The last two candidates of the fixed list, searched alone: c:\temp when it exists, otherwise
+    // c:\tmp, created when missing and returned even when it could not be made.
+    const std::vector<TempDirectoryCandidate> list = kov::tempDirectoryCandidates();
+    ASSERT_EQ(list.size(), 6u);
+    const std::string expected = isDirectory("c:\\temp") ? "c:\\temp" : "c:\\tmp";
+    const kov::TempDirectorySearchResult found = kov::searchTempDirectory({list[4], list[5]});
+    EXPECT_EQ(found.path, expected);
+    EXPECT_EQ(found.source, "");
+}
+
+TEST_F(TempDirWin32Test, SearchCreatesOnlyTheLastDriveLetterCandidate) {
+    const kov::TempDirectorySearchResult found = kov::searchTempDirectory({
+        TempDirectoryCandidate::fixed(forwardSlashes(at("temp"))),
+        TempDirectoryCandidate::fixed(forwardSlashes(at("tmp"))),
+    });
+    EXPECT_EQ(found.path, at("tmp"));
+    EXPECT_TRUE(isDirectory(at("tmp")));
+    EXPECT_FALSE(existsAtAll(at("temp")));
+}
+
+TEST_F(TempDirWin32Test, SecondCallReturnsTheFirstAnswerAfterTempChanged) {
+    const std::string first = makeDirectory("first");
+    setVariable("TEMP", first);
+    ASSERT_EQ(kov::getTempDirectory(), first);
+    setVariable("TEMP", makeDirectory("second"));
+    EXPECT_EQ(kov::getTempDirectory(), first);
+    EXPECT_EQ(source(), "TEMP");
+}
+
+}  // namespace
