@@ -250,6 +250,10 @@ template <typename Bind>
 int start(BtCursor* cur, int kind, Bind bind) {
     sqlite3_stmt* s = nullptr;
     int rc = statement(cur, kind, &s);
+    // A running statement cannot be bound again: leave it first. (A bind that
+    // copies the current key always targets a statement of the other
+    // direction, never the running one.)
+    if (s != nullptr && s == cur->row) leave(cur);
     if (rc == SQLITE_OK) rc = bind(s);
     leave(cur);
     if (rc != SQLITE_OK) {
@@ -552,7 +556,10 @@ int sqlite3BtreePrevious(BtCursor* pCur, int* pRes) {
     return moveResult(rc, pRes);
 }
 
-int sqlite3BtreeEof(BtCursor* pCur) { return pCur == nullptr || pCur->row == nullptr ? 1 : 0; }
+int sqlite3BtreeEof(BtCursor* pCur) {
+    if (pCur == nullptr) return SQLITE_MISUSE;  // nonzero: not on an entry
+    return pCur->row == nullptr ? 1 : 0;
+}
 
 int sqlite3BtreeMoveto(BtCursor* pCur, const void* pKey, std::int64_t nKey, int* pRes) {
     if (pCur == nullptr || pRes == nullptr) return SQLITE_MISUSE;

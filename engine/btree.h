@@ -43,8 +43,8 @@
 // 11. KeySize and DataSize report 0 for a cursor on no entry.
 //
 // Handles. Every operation tolerates a null engine or cursor handle: it
-// returns SQLITE_MISUSE and writes no out-value (sqlite3BtreeEof answers
-// 1). Closing the engine finalizes all of its statements and leaves each
+// returns SQLITE_MISUSE and writes no out-value (for sqlite3BtreeEof that
+// nonzero answer also means "not on an entry"). Closing the engine finalizes all of its statements and leaves each
 // of its cursors as an inert object that answers like a cursor on an empty
 // table (moves report no entry, sizes are 0, reads past nothing are
 // refused, inserts are refused with SQLITE_MISUSE) until it is itself
@@ -144,7 +144,8 @@ int sqlite3BtreeDropTable(Btree* p, std::uint32_t iTable, int* piMoved);
 
 // Opens a cursor on the table with the given root page (refused with
 // SQLITE_ERROR when no table has that root). wrFlag 1 = a writing cursor.
-// *ppCur receives the handle, or null when refused.
+// *ppCur receives the handle, or null when refused (a null engine handle
+// writes nothing, as everywhere).
 int sqlite3BtreeCursor(Btree* p, std::uint32_t iTable, int wrFlag, BtreeCompare xCmp,
                        void* pArg, BtCursor** ppCur);
 
@@ -158,7 +159,11 @@ int sqlite3BtreePrevious(BtCursor* pCur, int* pRes);
 int sqlite3BtreeEof(BtCursor* pCur);
 
 // pKey/nKey: the key bytes and their length on byte-string tables; on
-// integer-keyed tables pKey is null and nKey is the integer key itself.
+// integer-keyed tables pKey is ignored (the store passes null) and nKey is
+// the integer key itself. A refused move (null key on a byte-string table:
+// SQLITE_CORRUPT; negative length: SQLITE_ERROR) writes no *pRes and leaves
+// the cursor where it was; a move that fails inside SQLite leaves it on no
+// entry.
 int sqlite3BtreeMoveto(BtCursor* pCur, const void* pKey, std::int64_t nKey, int* pRes);
 
 // The key's length in bytes, or the integer key itself on an
@@ -174,9 +179,12 @@ int sqlite3BtreeDataSize(BtCursor* pCur, std::uint32_t* pSize);
 // Copies amt bytes of the data, from offset, into pBuf.
 int sqlite3BtreeData(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, void* pBuf);
 
-// Inserts or replaces one entry. pKey/nKey as for Moveto. pData may be null
-// only when nData is 0; a negative nData is refused with SQLITE_ERROR. On a
-// key-only table the data is not stored.
+// Inserts or replaces one entry. pKey/nKey as for Moveto (a null key on a
+// byte-string table is refused with SQLITE_CORRUPT, a negative key length
+// with SQLITE_ERROR). pData may be null only when nData is 0 (otherwise
+// SQLITE_MISUSE); a negative nData is refused with SQLITE_ERROR; keys or
+// data above SQLite's length limit (1e9 bytes) with SQLITE_TOOBIG. On a
+// key-only table the data is not stored. Refused inserts change nothing.
 int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, const void* pData,
                        int nData);
 

@@ -1,0 +1,222 @@
+// A run of the engine binding well past its page cache: about 100 MB of
+// 4 KiB values under integer keys, with the engine opened the way the store
+// opens it and its temporary directory pointed at a scratch directory made
+// here. Checks that the spilled temporary file lives in that directory,
+// already unlinked, while the engine is open; that nothing is left open or
+// on disk there after Close; and that every record reads back intact.
+#include <gtest/gtest.h>
+
+#include <algorithm>
+#include <cstdint>
+#include <cstring>
+#include <filesystem>
+#include <random>
+#include <string>
+#include <system_error>
+#include <vector>
+
+#include "engine/btree.h"
+#include "engine_test_util.h"
+
+namespace {
+
+namespace fs = std::filesystem;
+using namespace kov::engine;        // NOLINT(google-build-using-namespace)
+using namespace kov::engine::test;  // NOLINT(google-build-using-namespace)
+
+constexpr std::int64_t kRecords = 25600;  // 25 600 x 4 KiB = 100 MiB
+constexpr std::size_t kValueSize = 4096;
+
+// The value stored under `key` in `generation` (0 = first insert, 1 = the
+// replacement): the key's bytes, then bytes of a generator seeded by both.
+void fillValue(std::int64_t key, int generation, std::string& out) {
+    out.resize(kValueSize);
+    std::uint64_t x = static_cast<std::uint64_t>(key) * 0x9E3779B97F4A7C15ull +
+                      static_cast<std::uint64_t>(generation + 1) * 0xD1B54A32D192ED03ull;
+    std::memcpy(out.data(), &key, sizeof key);
+    for (std::size_t i = sizeof key; i + 8 <= kValueSize; i += 8) {
+        x ^= x << 13;
+        x ^= x >> 7;
+        x ^= x << 17;
+        std::memcpy(out.data() + i, &x, 8);
+    }
+}
+
+// A fresh, empty directory under the system's temporary path; removed with
+// its content on destruction.
+class ScratchDir {
+  public:
+    ScratchDir() {
+        std::random_device rd;
+        for (int attempt = 0; attempt < 100 && path_.empty(); ++attempt) {
+            fs::path candidate =
+                fs::temp_directory_path() /
+                ("kovpager-engine-large-" + std::to_string(rd()) + "-" + std::to_string(rd()));
+            std::error_code ec;
+            if (fs::create_directory(candidate, ec) && !ec)
+                path_ = fs::canonical(candidate, ec);
+        }
+    }
+    ~ScratchDir() {
+        std::error_code ec;
+        if (!path_.empty())
+            fs::remove_all(path_, ec);
+    }
+    ScratchDir(const ScratchDir&) = delete;
+    ScratchDir& operator=(const ScratchDir&) = delete;
+
+    const fs::path& path() const { return path_; }
+
+    // The names of the entries in the directory.
+    std::vector<std::string> entries() const {
+        std::vector<std::string> names;
+        std::error_code ec;
+        for (fs::directory_iterator it(path_, ec), end; !ec && it != end; it.increment(ec))
+            names.push_back(it->path().filename().string());
+        return names;
+    }
+
+  private:
+    fs::path path_;
+};
+
+// The targets of this process's open file descriptors that lie in `dir`,
+// as the kernel shows them (a deleted file's target ends in " (deleted)").
+// Empty where the system has no /proc/self/fd.
+std::vector<std::string> openFilesIn(const fs::path& dir) {
+    std::vector<std::string> found;
+    const std::string prefix = dir.string() + "/";
+    std::error_code ec;
+    for (fs::directory_iterator it("/proc/self/fd", ec), end; !ec && it != end; it.increment(ec)) {
+        std::error_code linkEc;
+        fs::path target = fs::read_symlink(it->path(), linkEc);
+        if (linkEc)
+            continue;
+        const std::string t = target.string();
+        if (t.compare(0, prefix.size(), prefix) == 0)
+            found.push_back(t);
+    }
+    return found;
+}
+
+bool haveProcFd() {
+    std::error_code ec;
+    return fs::is_directory("/proc/self/fd", ec);
+}
+
+bool endsWith(const std::string& s, const std::string& tail) {
+    return s.size() >= tail.size() && s.compare(s.size() - tail.size(), tail.size(), tail) == 0;
+}
+
+// Points the engine's temporary-directory setting at a buffer for the
+// lifetime of this object, then restores the previous setting.
+class TempDirSetting {
+  public:
+    explicit TempDirSetting(const std::string& dir) : buffer_(dir.begin(), dir.end()) {
+        buffer_.push_back('\0');
+        previous_ = temporaryDirectorySetting();
+        temporaryDirectorySetting() = buffer_.data();
+    }
+    ~TempDirSetting() { temporaryDirectorySetting() = previous_; }
+    TempDirSetting(const TempDirSetting&) = delete;
+    TempDirSetting& operator=(const TempDirSetting&) = delete;
+
+  private:
+    std::vector<char> buffer_;
+    char* previous_ = nullptr;
+};
+
+TEST(EngineLarge, RunPastTheCacheSpillsIntoTheTemporaryDirectoryAndReadsBack) {
+    ScratchDir scratch;
+    ASSERT_FALSE(scratch.path().empty()) << "could not make a scratch directory";
+    const bool procFd = haveProcFd();
+    if (procFd) {
+        ASSERT_TRUE(openFilesIn(scratch.path()).empty());
+    }
+
+    {
+        TempDirSetting setting(scratch.path().string());
+        TestEngine engine;  // flags 3, page size 4096, 16384 cache pages, BeginTrans(2)
+        ASSERT_EQ(engine.openRc, SQLITE_OK);
+        ASSERT_NE(engine.get(), nullptr);
+        ASSERT_EQ(engine.pageSizeRc, SQLITE_OK);
+        ASSERT_EQ(engine.cacheSizeRc, SQLITE_OK);
+        ASSERT_EQ(engine.beginRc, SQLITE_OK);
+        std::uint32_t root = engine.createTable(kIntTable);
+        ASSERT_NE(root, 0u);
+
+        std::string value;
+        {
+            TestCursor w(engine.get(), root, 1);
+            ASSERT_EQ(w.rc, SQLITE_OK);
+            for (std::int64_t k = 0; k < kRecords; ++k) {
+                fillValue(k, 0, value);
+                ASSERT_EQ(insertInt(w.get(), k, value), SQLITE_OK) << "key " << k;
+            }
+            // Replace every 97th record, far behind the cache's reach.
+            for (std::int64_t k = 0; k < kRecords; k += 97) {
+                fillValue(k, 1, value);
+                ASSERT_EQ(insertInt(w.get(), k, value), SQLITE_OK) << "key " << k;
+            }
+        }
+
+        // The data is far larger than the cache, so the temporary file exists
+        // by now: open in the scratch directory and already unlinked from it.
+        if (procFd) {
+            std::vector<std::string> open = openFilesIn(scratch.path());
+            ASSERT_FALSE(open.empty()) << "no temporary file open in " << scratch.path();
+            for (const auto& target : open)
+                EXPECT_TRUE(endsWith(target, " (deleted)")) << target;
+            EXPECT_TRUE(scratch.entries().empty())
+                << "the temporary file is still linked: " << scratch.entries().front();
+        }
+
+        // Every record, in key order.
+        TestCursor r(engine.get(), root, 0);
+        ASSERT_EQ(r.rc, SQLITE_OK);
+        std::string expected;
+        std::string got(kValueSize, '\0');
+        int res = 1;
+        ASSERT_EQ(sqlite3BtreeFirst(r.get(), &res), SQLITE_OK);
+        for (std::int64_t k = 0; k < kRecords; ++k) {
+            ASSERT_EQ(res, 0) << "walk ended before key " << k;
+            std::int64_t key = -1;
+            ASSERT_EQ(sqlite3BtreeKeySize(r.get(), &key), SQLITE_OK);
+            ASSERT_EQ(key, k);
+            std::uint32_t size = 0;
+            ASSERT_EQ(sqlite3BtreeDataSize(r.get(), &size), SQLITE_OK);
+            ASSERT_EQ(size, kValueSize) << "key " << k;
+            ASSERT_EQ(sqlite3BtreeData(r.get(), 0, size, got.data()), SQLITE_OK) << "key " << k;
+            fillValue(k, k % 97 == 0 ? 1 : 0, expected);
+            ASSERT_TRUE(got == expected) << "data of key " << k;
+            ASSERT_EQ(sqlite3BtreeNext(r.get(), &res), SQLITE_OK);
+        }
+        EXPECT_EQ(res, 1) << "more entries than inserted";
+
+        // Random seeks across the whole file, each followed by a read.
+        std::mt19937_64 rng(99);
+        for (int i = 0; i < 2000; ++i) {
+            std::int64_t k = static_cast<std::int64_t>(rng() % kRecords);
+            ASSERT_EQ(seekInt(r.get(), k), 0) << "key " << k;
+            ASSERT_EQ(currentIntKey(r.get()), k);
+            ASSERT_EQ(sqlite3BtreeData(r.get(), 0, kValueSize, got.data()), SQLITE_OK);
+            fillValue(k, k % 97 == 0 ? 1 : 0, expected);
+            ASSERT_TRUE(got == expected) << "data of key " << k;
+        }
+        EXPECT_LT(seekInt(r.get(), kRecords), 0);
+        EXPECT_EQ(currentIntKey(r.get()), kRecords - 1);
+
+        ASSERT_EQ(r.close(), SQLITE_OK);
+        EXPECT_EQ(engine.close(), SQLITE_OK);
+    }
+
+    // Nothing open there and nothing left behind.
+    if (procFd) {
+        std::vector<std::string> open = openFilesIn(scratch.path());
+        EXPECT_TRUE(open.empty()) << "still open after Close: " << open.front();
+    }
+    std::vector<std::string> left = scratch.entries();
+    EXPECT_TRUE(left.empty()) << "left in the temporary directory: " << left.front();
+}
+
+}  // namespace
