@@ -9,7 +9,7 @@ CTEST_ARGS ?=
 
 DEPS_PACKAGES = cmake make g++ pkg-config libsqlite3-dev libgtest-dev libgmock-dev libbenchmark-dev
 
-.PHONY: all deps configure build demo test bench install clean
+.PHONY: all deps configure build demo test bench bench-run install clean
 
 all: build
 
@@ -28,13 +28,17 @@ demo: build
 test: build
 	cd $(BUILD) && ctest --output-on-failure -j $(JOBS) $(CTEST_ARGS)
 
+# Benchmarks build in Release in their own directory. A quick run:
+#   make bench KOV_BENCH_N=20000
+bench: BUILD := build-release
+bench: BUILD_TYPE := Release
 bench: build
-	$(MAKE) -C . bench-run
+	$(MAKE) -C . bench-run BUILD=$(BUILD)
 
 bench-run:
 	@for b in $(BUILD)/bench/*_benchmark; do \
 	    [ -x "$$b" ] || continue; \
-	    echo "== $$b"; "$$b" --benchmark_counters_tabular=true || exit 1; \
+	    echo "== $$b"; "$$b" --benchmark_counters_tabular=true $(BENCH_ARGS) || exit 1; \
 	done
 
 install: build

@@ -1,0 +1,236 @@
+// Shared helpers of the benchmark programs: the workload size, the
+// reproducible key material, and the paired timer that runs a measured side
+// and the raw baseline alternately in the same process.
+//
+// Workload size N: 1 000 000 by default; the command-line flag
+// --kov_bench_n=N (taken out before Google Benchmark sees the arguments) or
+// the environment variable KOV_BENCH_N sets it, the flag winning. Random
+// seeks use N / 10 lookups.
+//
+// Pairing. PairTimer::run splits a workload of `count` operations into
+// chunks and runs the two sides chunk by chunk, alternating which side goes
+// first, so both see the same machine (other processes, the kernel's page
+// cache, CPU frequency) at nearly the same moment. Each side's time is the
+// sum of its own chunks, on the processor clock and on the wall clock;
+// setPairCounters reports per-operation times and the measured/raw ratio as
+// counters of the same benchmark run.
+#ifndef KOVPAGER_BENCH_BENCH_UTIL_H
+#define KOVPAGER_BENCH_BENCH_UTIL_H
+
+#include <benchmark/benchmark.h>
+
+#include <algorithm>
+#include <array>
+#include <chrono>
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
+#include <ctime>
+#include <string>
+#include <vector>
+
+namespace kov::bench {
+
+// Removes --kov_bench_n=N from the arguments and returns the workload size.
+inline std::int64_t takeWorkloadSize(int* argc, char** argv) {
+    std::int64_t n = 1000000;
+    if (const char* env = std::getenv("KOV_BENCH_N"); env != nullptr && *env != '\0') {
+        n = std::strtoll(env, nullptr, 10);
+    }
+    static constexpr char kFlag[] = "--kov_bench_n=";
+    int kept = 1;
+    for (int i = 1; i < *argc; ++i) {
+        if (std::strncmp(argv[i], kFlag, sizeof kFlag - 1) == 0) {
+            n = std::strtoll(argv[i] + sizeof kFlag - 1, nullptr, 10);
+        } else {
+            argv[kept++] = argv[i];
+        }
+    }
+    *argc = kept;
+    return std::max<std::int64_t>(n, 1000);
+}
+
+// SplitMix64: a small, fast, reproducible generator.
+class Random {
+  public:
+    explicit Random(std::uint64_t seed) : state_(seed) {}
+    std::uint64_t next() {
+        std::uint64_t z = (state_ += 0x9E3779B97F4A7C15ULL);
+        z = (z ^ (z >> 30)) * 0xBF58476D1CE4E5B9ULL;
+        z = (z ^ (z >> 27)) * 0x94D049BB133111EBULL;
+        return z ^ (z >> 31);
+    }
+    std::size_t below(std::size_t bound) { return static_cast<std::size_t>(next() % bound); }
+
+  private:
+    std::uint64_t state_;
+};
+
+using Key16 = std::array<unsigned char, 16>;
+
+// Stores v big-endian, so byte order and numeric order agree.
+inline void putBigEndian(unsigned char* out, std::uint64_t v) {
+    for (int i = 7; i >= 0; --i) {
+        out[i] = static_cast<unsigned char>(v);
+        v >>= 8;
+    }
+}
+
+// n random 16-byte keys, the same for every run.
+inline std::vector<Key16> randomKeys(std::size_t n, std::uint64_t seed) {
+    Random random(seed);
+    std::vector<Key16> keys(n);
+    for (Key16& k : keys) {
+        putBigEndian(k.data(), random.next());
+        putBigEndian(k.data() + 8, random.next());
+    }
+    return keys;
+}
+
+// count indices drawn from [0, bound), the same for every run.
+inline std::vector<std::size_t> randomIndices(std::size_t count, std::size_t bound,
+                                              std::uint64_t seed) {
+    Random random(seed);
+    std::vector<std::size_t> out(count);
+    for (std::size_t& i : out) {
+        i = random.below(bound);
+    }
+    return out;
+}
+
+// The 100-byte data of entry i: its index in the first 8 bytes, then a
+// fixed pattern.
+constexpr std::size_t kDataSize = 100;
+class Payload {
+  public:
+    Payload() {
+        for (std::size_t i = 0; i < kDataSize; ++i) {
+            bytes_[i] = static_cast<unsigned char>('a' + i % 26);
+        }
+    }
+    const unsigned char* forEntry(std::uint64_t i) {
+        std::memcpy(bytes_.data(), &i, sizeof i);
+        return bytes_.data();
+    }
+
+  private:
+    std::array<unsigned char, kDataSize> bytes_{};
+};
+
+// Reads the entry index back out of a data buffer (for checksums).
+inline std::uint64_t entryOf(const void* data) {
+    std::uint64_t i;
+    std::memcpy(&i, data, sizeof i);
+    return i;
+}
+
+// Running totals of one side of a read workload; the two sides' tallies
+// must agree.
+struct Tally {
+    std::size_t rows = 0;
+    std::uint64_t sum = 0;
+    void add(const unsigned char* key, std::size_t keySize, const unsigned char* data) {
+        ++rows;
+        sum += entryOf(data) * 31 + (keySize > 0 ? key[0] : 0) + keySize;
+    }
+    bool operator==(const Tally& other) const { return rows == other.rows && sum == other.sum; }
+};
+
+// Times two sides run alternately, chunk by chunk.
+// A moment, on both clocks.
+struct Times {
+    double cpu = 0;   // seconds of processor time used by the process
+    double wall = 0;  // seconds on the steady clock
+};
+
+class PairTimer {
+  public:
+    static constexpr std::size_t kUnitsAreOperations = ~std::size_t{0};
+
+    // Runs raw(begin, end) and measured(begin, end) over [0, count) in
+    // chunks of `chunk` units, alternating which side runs first. A unit is
+    // one operation unless `operations` says how many the whole run makes.
+    template <class Raw, class Measured>
+    void run(std::size_t count, std::size_t chunk, Raw&& raw, Measured&& measured,
+             std::size_t operations = kUnitsAreOperations) {
+        bool rawFirst = (runs_++ % 2) == 0;
+        for (std::size_t begin = 0; begin < count; begin += chunk) {
+            std::size_t end = std::min(count, begin + chunk);
+            for (int side = 0; side < 2; ++side) {
+                bool doRaw = (side == 0) == rawFirst;
+                Times start = now();
+                if (doRaw) {
+                    raw(begin, end);
+                } else {
+                    measured(begin, end);
+                }
+                Times stop = now();
+                (doRaw ? raw_ : measured_).add(start, stop);
+                if (!doRaw) {
+                    lastMeasuredWall_ += stop.wall - start.wall;
+                }
+            }
+            rawFirst = !rawFirst;
+        }
+        operations_ += operations == kUnitsAreOperations ? count : operations;
+    }
+
+    // The measured side's wall time since the previous call (for the
+    // benchmark's manual timing).
+    double takeMeasuredWallSeconds() {
+        double s = lastMeasuredWall_;
+        lastMeasuredWall_ = 0;
+        return s;
+    }
+
+    struct Totals {
+        double cpu = 0;   // seconds of processor time
+        double wall = 0;  // seconds of elapsed time
+        void add(const Times& start, const Times& stop) {
+            cpu += stop.cpu - start.cpu;
+            wall += stop.wall - start.wall;
+        }
+    };
+    const Totals& raw() const { return raw_; }
+    const Totals& measured() const { return measured_; }
+    std::size_t operations() const { return operations_; }
+
+  private:
+    static Times now() {
+        Times t;
+        t.wall = std::chrono::duration<double>(std::chrono::steady_clock::now().time_since_epoch())
+                     .count();
+        timespec ts{};
+        clock_gettime(CLOCK_PROCESS_CPUTIME_ID, &ts);
+        t.cpu = static_cast<double>(ts.tv_sec) + static_cast<double>(ts.tv_nsec) * 1e-9;
+        return t;
+    }
+
+    Totals raw_;
+    Totals measured_;
+    double lastMeasuredWall_ = 0;
+    std::size_t operations_ = 0;
+    unsigned runs_ = 0;
+};
+
+// Reports, over everything the timer ran: <name>_ns and raw_ns, processor
+// nanoseconds per operation; ratio, measured / raw processor time; and
+// wall_ratio, the same for elapsed time. Processor time is the figure to
+// trust on a shared machine (a side that waits for the processor is not
+// charged for it); the benchmark is single-threaded, so the process's
+// processor time is this thread's.
+inline void setPairCounters(benchmark::State& state, const PairTimer& timer,
+                            const std::string& name) {
+    if (timer.operations() == 0 || timer.raw().cpu <= 0 || timer.raw().wall <= 0) {
+        return;
+    }
+    double ops = static_cast<double>(timer.operations());
+    state.counters[name + "_ns"] = timer.measured().cpu * 1e9 / ops;
+    state.counters["raw_ns"] = timer.raw().cpu * 1e9 / ops;
+    state.counters["ratio"] = timer.measured().cpu / timer.raw().cpu;
+    state.counters["wall_ratio"] = timer.measured().wall / timer.raw().wall;
+}
+
+}  // namespace kov::bench
+
+#endif  // KOVPAGER_BENCH_BENCH_UTIL_H

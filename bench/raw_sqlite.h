@@ -1,0 +1,294 @@
+// The raw baseline the benchmarks measure the store against: SQLite driven
+// by hand, with exactly the store's settings and nothing in between.
+//
+// One RawDatabase is one private connection on a temporary on-disk database
+// (opened with the empty file name, deleted by SQLite on close), with
+// 4096-byte pages, a 16384-page cache, no journal, the exclusive lock, no
+// syncing, and one exclusive transaction that is never committed: the
+// database lives and dies as scratch space, as the store's does.
+//
+// Three table kinds mirror the store's:
+//   RawIntTable   (k INTEGER PRIMARY KEY, v BLOB)
+//   RawBlobTable  (k BLOB PRIMARY KEY, v BLOB) WITHOUT ROWID
+//   RawKeyTable   (k BLOB PRIMARY KEY) WITHOUT ROWID
+// Each table prepares its statements once, at construction, and reuses them.
+// Inserts replace an entry with an equal key, the store's rule too: INSERT
+// OR REPLACE where there is data; on key-only tables INSERT OR IGNORE, which
+// comes to the same (an equal key is the same entry) and costs less. Byte keys are always bound as
+// blobs (a zero-length key as a zero-length blob, never NULL), so they compare bytewise unsigned,
+// shorter first.
+//
+// Every failure throws RawError with SQLite's message. Tables hold
+// statements of their database: destroy them before the database.
+//
+//     kov::bench::RawDatabase db;
+//     kov::bench::RawBlobTable t(db);
+//     t.insert("k", 1, "v", 1);
+//     for (RawScan& s = t.scan(); s.step();) use(s.blob(0), s.bytes(0));
+//
+// Threads: one thread at a time per database (the connection is opened
+// without SQLite's own mutex).
+#ifndef KOVPAGER_BENCH_RAW_SQLITE_H
+#define KOVPAGER_BENCH_RAW_SQLITE_H
+
+#include <sqlite3.h>
+
+#include <cstdint>
+#include <cstring>
+#include <stdexcept>
+#include <string>
+
+namespace kov::bench {
+
+// A failure reported by SQLite, with its message.
+class RawError : public std::runtime_error {
+  public:
+    explicit RawError(const std::string& what) : std::runtime_error(what) {}
+};
+
+// One prepared statement, finalized on destruction.
+class RawStatement {
+  public:
+    RawStatement(sqlite3* db, const std::string& sql) : db_(db) {
+        if (sqlite3_prepare_v3(db, sql.c_str(), -1, SQLITE_PREPARE_PERSISTENT, &stmt_, nullptr) !=
+            SQLITE_OK) {
+            throw RawError("prepare \"" + sql + "\": " + sqlite3_errmsg(db));
+        }
+    }
+    ~RawStatement() { sqlite3_finalize(stmt_); }
+    RawStatement(const RawStatement&) = delete;
+    RawStatement& operator=(const RawStatement&) = delete;
+
+    sqlite3_stmt* get() const { return stmt_; }
+
+    // Binds bytes as a blob that SQLite does not copy: the bytes must stay
+    // put until the statement is reset.
+    void bindBlob(int index, const void* bytes, std::size_t size) {
+        // A null pointer would bind NULL, not an empty blob.
+        int rc = size == 0 ? sqlite3_bind_zeroblob(stmt_, index, 0)
+                           : sqlite3_bind_blob(stmt_, index, bytes, static_cast<int>(size),
+                                               SQLITE_STATIC);
+        check(rc, "bind");
+    }
+    void bindInt(int index, std::int64_t value) {
+        check(sqlite3_bind_int64(stmt_, index, value), "bind");
+    }
+
+    // Runs a statement that returns no row, then resets it.
+    void run() {
+        int rc = sqlite3_step(stmt_);
+        sqlite3_reset(stmt_);
+        if (rc != SQLITE_DONE) {
+            fail("step");
+        }
+    }
+
+    // Steps once: true on a row; false when done, the statement then reset.
+    bool step() {
+        int rc = sqlite3_step(stmt_);
+        if (rc == SQLITE_ROW) {
+            return true;
+        }
+        sqlite3_reset(stmt_);
+        if (rc != SQLITE_DONE) {
+            fail("step");
+        }
+        return false;
+    }
+    void reset() { sqlite3_reset(stmt_); }
+
+    // Column readers for the current row. A blob pointer stays valid until
+    // the next step or reset.
+    const void* blob(int column) const { return sqlite3_column_blob(stmt_, column); }
+    std::size_t bytes(int column) const {
+        return static_cast<std::size_t>(sqlite3_column_bytes(stmt_, column));
+    }
+    std::int64_t integer(int column) const { return sqlite3_column_int64(stmt_, column); }
+
+  private:
+    void check(int rc, const char* what) {
+        if (rc != SQLITE_OK) {
+            fail(what);
+        }
+    }
+    [[noreturn]] void fail(const char* what) {
+        throw RawError(std::string(what) + ": " + sqlite3_errmsg(db_));
+    }
+
+    sqlite3* db_;
+    sqlite3_stmt* stmt_ = nullptr;
+};
+
+// A scan is the table's ordered-walk statement: step() until false.
+using RawScan = RawStatement;
+
+// One connection on one private temporary database, transaction open.
+class RawDatabase {
+  public:
+    RawDatabase() {
+        int rc = sqlite3_open_v2(
+            "", &db_, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX, nullptr);
+        if (rc != SQLITE_OK) {
+            std::string message = db_ != nullptr ? sqlite3_errmsg(db_) : sqlite3_errstr(rc);
+            sqlite3_close(db_);
+            throw RawError("open: " + message);
+        }
+        try {
+            exec("PRAGMA page_size=4096");
+            exec("PRAGMA cache_size=16384");
+            exec("PRAGMA journal_mode=OFF");
+            exec("PRAGMA locking_mode=EXCLUSIVE");
+            exec("PRAGMA synchronous=OFF");
+            exec("BEGIN EXCLUSIVE");
+        } catch (...) {
+            sqlite3_close(db_);
+            throw;
+        }
+    }
+    // Never committed: closing discards the transaction and the file.
+    // close_v2 tolerates statements still alive (it waits for them).
+    ~RawDatabase() { sqlite3_close_v2(db_); }
+    RawDatabase(const RawDatabase&) = delete;
+    RawDatabase& operator=(const RawDatabase&) = delete;
+
+    sqlite3* handle() const { return db_; }
+
+    void exec(const std::string& sql) {
+        char* error = nullptr;
+        if (sqlite3_exec(db_, sql.c_str(), nullptr, nullptr, &error) != SQLITE_OK) {
+            std::string message = error != nullptr ? error : sqlite3_errmsg(db_);
+            sqlite3_free(error);
+            throw RawError("\"" + sql + "\": " + message);
+        }
+    }
+
+    // A fresh table name in this database.
+    std::string newTableName() { return "t" + std::to_string(++tables_); }
+
+  private:
+    sqlite3* db_ = nullptr;
+    int tables_ = 0;
+};
+
+// (k INTEGER PRIMARY KEY, v BLOB).
+class RawIntTable {
+  public:
+    explicit RawIntTable(RawDatabase& db) : RawIntTable(db, create(db)) {}
+
+    void insert(std::int64_t key, const void* data, std::size_t dataSize) {
+        insert_.bindInt(1, key);
+        insert_.bindBlob(2, data, dataSize);
+        insert_.run();
+    }
+    // Columns: 0 = key (integer), 1 = data.
+    RawScan& scan() { return scan_; }
+
+  private:
+    RawIntTable(RawDatabase& db, const std::string& name)
+        : insert_(db.handle(), "INSERT OR REPLACE INTO " + name + "(k, v) VALUES(?1, ?2)"),
+          scan_(db.handle(), "SELECT k, v FROM " + name + " ORDER BY k") {}
+    static std::string create(RawDatabase& db) {
+        std::string name = db.newTableName();
+        db.exec("CREATE TABLE " + name + "(k INTEGER PRIMARY KEY, v BLOB)");
+        return name;
+    }
+
+    RawStatement insert_;
+    RawStatement scan_;
+};
+
+// (k BLOB PRIMARY KEY, v BLOB) WITHOUT ROWID.
+class RawBlobTable {
+  public:
+    explicit RawBlobTable(RawDatabase& db) : RawBlobTable(db, create(db)) {}
+
+    void insert(const void* key, std::size_t keySize, const void* data, std::size_t dataSize) {
+        insert_.bindBlob(1, key, keySize);
+        insert_.bindBlob(2, data, dataSize);
+        insert_.run();
+    }
+    // Columns: 0 = key, 1 = data.
+    RawScan& scan() { return scan_; }
+
+    // Point seek: when the key exists, copies up to `capacity` leading bytes
+    // of its data into `buffer` and returns the data's full length;
+    // otherwise returns -1 and copies nothing.
+    std::int64_t seekData(const void* key, std::size_t keySize, void* buffer,
+                          std::size_t capacity) {
+        seek_.bindBlob(1, key, keySize);
+        if (!seek_.step()) {
+            return -1;
+        }
+        std::size_t size = seek_.bytes(0);
+        if (size > 0) {
+            std::memcpy(buffer, seek_.blob(0), size < capacity ? size : capacity);
+        }
+        seek_.reset();
+        return static_cast<std::int64_t>(size);
+    }
+
+  private:
+    RawBlobTable(RawDatabase& db, const std::string& name)
+        : insert_(db.handle(), "INSERT OR REPLACE INTO " + name + "(k, v) VALUES(?1, ?2)"),
+          scan_(db.handle(), "SELECT k, v FROM " + name + " ORDER BY k"),
+          seek_(db.handle(), "SELECT v FROM " + name + " WHERE k = ?1") {}
+    static std::string create(RawDatabase& db) {
+        std::string name = db.newTableName();
+        db.exec("CREATE TABLE " + name + "(k BLOB PRIMARY KEY, v BLOB) WITHOUT ROWID");
+        return name;
+    }
+
+    RawStatement insert_;
+    RawStatement scan_;
+    RawStatement seek_;
+};
+
+// (k BLOB PRIMARY KEY) WITHOUT ROWID: key-only entries with composite keys
+// (a group prefix followed by a payload).
+class RawKeyTable {
+  public:
+    explicit RawKeyTable(RawDatabase& db) : RawKeyTable(db, create(db)) {}
+
+    void insert(const void* key, std::size_t keySize) {
+        insert_.bindBlob(1, key, keySize);
+        insert_.run();
+    }
+
+    // Walks every entry whose key begins with the prefix, in key order, and
+    // calls visit(payload, payloadSize) with the bytes after the prefix.
+    // Returns the number of entries walked.
+    template <class Visit>
+    std::size_t walkPrefix(const void* prefix, std::size_t prefixSize, Visit&& visit) {
+        walk_.bindBlob(1, prefix, prefixSize);
+        std::size_t walked = 0;
+        while (walk_.step()) {
+            const auto* key = static_cast<const unsigned char*>(walk_.blob(0));
+            std::size_t keySize = walk_.bytes(0);
+            if (keySize < prefixSize ||
+                (prefixSize > 0 && std::memcmp(key, prefix, prefixSize) != 0)) {
+                walk_.reset();
+                break;
+            }
+            visit(key + prefixSize, keySize - prefixSize);
+            ++walked;
+        }
+        return walked;
+    }
+
+  private:
+    RawKeyTable(RawDatabase& db, const std::string& name)
+        : insert_(db.handle(), "INSERT OR IGNORE INTO " + name + "(k) VALUES(?1)"),
+          walk_(db.handle(), "SELECT k FROM " + name + " WHERE k >= ?1 ORDER BY k") {}
+    static std::string create(RawDatabase& db) {
+        std::string name = db.newTableName();
+        db.exec("CREATE TABLE " + name + "(k BLOB PRIMARY KEY) WITHOUT ROWID");
+        return name;
+    }
+
+    RawStatement insert_;
+    RawStatement walk_;
+};
+
+}  // namespace kov::bench
+
+#endif  // KOVPAGER_BENCH_RAW_SQLITE_H
