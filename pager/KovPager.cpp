@@ -1,0 +1,231 @@
+// The pager: the singleton that owns the engine, and the cursor registry.
+//
+// Design notes.
+//
+// 1. The singleton. instance() holds a guarded function-local static pointer, initialised by
+//    create(): create() placement-constructs the pager in static storage and only then registers
+//    atExit() with std::atexit, so a constructor that throws registers nothing and the next call
+//    of instance() tries again. The pager's lifetime never ends: atExit() runs teardown() but does
+//    not destroy the object, so host objects destroyed later still find a valid pager with no
+//    engine (and do nothing).
+//
+// 2. The registry. cursorSlots_ holds one CursorSlot per registered cursor, in order of
+//    registration; a cursor names its slot by index. Slot states:
+//
+//      state                   cursor        rootPage
+//      live, open              engine cursor table's root
+//      live, refused           null          table's root   (the engine refused the cursor)
+//      live, closed            null          table's root   (inside a table creation only)
+//      live, stale             inert cursor  table's root   (after reset(); freed by the next
+//                                                            closeAllCursors or by teardown)
+//      free                    null          0xFFFFFFFF
+//
+//    Slots are appended, never reused; only trailing free slots are removed, so the index of a
+//    live slot never changes. A slot is released only while the engine is open.
+//
+// 3. Table creation. The engine refuses to create (or drop) a table while any cursor is open, so
+//    KovBtree's constructor calls closeAllCursors() (saving each live cursor's key: 8 native-order
+//    bytes of the integer key, or the whole byte-string key; a cursor on no entry saves 0 or the
+//    empty key), creates the table, then restoreAllCursors() (reopening every live slot as a
+//    writing cursor and searching for its saved key, which lands on that key when it still exists).
+//
+// 4. The temporary directory. tempDir_ is the pager's own copy of the directory; the engine's
+//    directory setting points into its buffer from construction until teardown, and operator=
+//    on the singleton re-points it after replacing the text. Teardown sets it to null before
+//    releasing the buffer.
+//
+// 5. Engine status codes are not examined: a refusal is a silent no-op. Out-values are
+//    initialised before each engine call, so a refused call reads as "no entry". The one
+//    exception is the zero-byte key read in closeAllCursors (see there).
+#include <kovpager/KovPager.h>
+
+#include <cstdlib>
+#include <cstring>
+#include <new>
+
+#include "engine/btree.h"
+#include "tempdir/TempDirectory.h"
+
+namespace eng = kov::engine;
+
+namespace {
+
+constexpr std::uint32_t kFreeSlot = 0xFFFFFFFFu;
+
+// Storage of the one pager. Static, so it outlives every host object.
+alignas(KovPager) unsigned char gPagerStorage[sizeof(KovPager)];
+
+// The constructed pager, or null before the first successful construction.
+KovPager* gPager = nullptr;
+
+}  // namespace
+
+const std::int64_t KovPager::defaultPageSize_;
+const std::int64_t KovPager::defaultCacheSize_;
+
+KovPager* KovPager::instance() {
+    static KovPager* const pager = create();
+    return pager;
+}
+
+KovPager* KovPager::create() {
+    KovPager* pager = new (gPagerStorage) KovPager();
+    gPager = pager;
+    std::atexit(&KovPager::atExit);
+    return pager;
+}
+
+void KovPager::atExit() {
+    if (gPager != nullptr)
+        gPager->teardown();
+}
+
+KovPager::KovPager() : engine_(nullptr) {
+    const std::string dir = kov::getTempDirectory();
+    tempDir_.assign(dir.c_str());  // up to the first NUL
+    eng::temporaryDirectorySetting() = tempDir_.data();
+    initialize();
+}
+
+KovPager::~KovPager() {
+    teardown();
+}
+
+KovPager::KovPager(const KovPager& other)
+    : engine_(other.engine_), cursorSlots_(other.cursorSlots_), tempDir_(other.tempDir_) {}
+
+KovPager& KovPager::operator=(const KovPager& other) {
+    engine_ = other.engine_;
+    cursorSlots_ = other.cursorSlots_;
+    if (this != &other)
+        tempDir_ = other.tempDir_;
+    // The engine reads the setting each time it names a file: never leave it dangling.
+    if (this == gPager) {
+        eng::temporaryDirectorySetting() = tempDir_.data();
+    }
+    return *this;
+}
+
+void KovPager::reset() {
+    if (engine_ != nullptr) {
+        eng::sqlite3BtreeClose(engine_);
+        engine_ = nullptr;
+    }
+}
+
+void KovPager::initialize() {
+    if (engine_ != nullptr) {
+        eng::sqlite3BtreeClose(engine_);
+        engine_ = nullptr;
+    }
+    eng::sqlite3BtreeOpen(nullptr, nullptr, &engine_,
+                          eng::BTREE_OMIT_JOURNAL | eng::BTREE_NO_READLOCK);
+    eng::sqlite3BtreeSetPageSize(engine_, static_cast<int>(defaultPageSize_), -1);
+    eng::sqlite3BtreeSetCacheSize(engine_, static_cast<int>(defaultCacheSize_));
+    eng::sqlite3BtreeBeginTrans(engine_, 2);
+}
+
+void KovPager::closeAllCursors(std::vector<std::string>& saved) {
+    saved.resize(cursorSlots_.size());
+    for (std::size_t i = 0; i < cursorSlots_.size(); ++i) {
+        CursorSlot& slot = cursorSlots_[i];
+        if (slot.rootPage == kFreeSlot)
+            continue;
+        std::int64_t size = 0;
+        eng::sqlite3BtreeKeySize(slot.cursor, &size);
+        std::string& key = saved[i];
+        if ((slot.tableFlags & eng::BTREE_INTKEY) != 0) {
+            key.resize(sizeof size);
+            std::memcpy(key.data(), &size, sizeof size);
+        } else {
+            // A slot registered before a reset may have been reopened on an integer-keyed table
+            // of the new engine; its "size" is then an integer key. The engine refuses a byte
+            // read on such a table, even of zero bytes: the key is then saved as empty.
+            if (size > 0 && eng::sqlite3BtreeKey(slot.cursor, 0, 0, nullptr) != eng::SQLITE_OK) {
+                size = 0;
+            }
+            key.resize(size > 0 ? static_cast<std::size_t>(size) : 0);
+            if (size > 0) {
+                eng::sqlite3BtreeKey(slot.cursor, 0, static_cast<std::uint32_t>(size), key.data());
+            }
+        }
+        if (slot.cursor != nullptr)
+            eng::sqlite3BtreeCloseCursor(slot.cursor);
+        slot.cursor = nullptr;
+    }
+}
+
+void KovPager::restoreAllCursors(const std::vector<std::string>& saved) {
+    for (std::size_t i = 0; i < cursorSlots_.size(); ++i) {
+        if (cursorSlots_[i].rootPage == kFreeSlot)
+            continue;
+        eng::sqlite3BtreeCursor(engine_, cursorSlots_[i].rootPage, 1, nullptr, nullptr,
+                                &cursorSlots_[i].cursor);
+        const std::string empty;
+        const std::string& key = i < saved.size() ? saved[i] : empty;
+        int compare = 0;
+        if ((cursorSlots_[i].tableFlags & eng::BTREE_INTKEY) != 0) {
+            std::int64_t intKey = 0;
+            std::memcpy(&intKey, key.data(),
+                        key.size() < sizeof intKey ? key.size() : sizeof intKey);
+            eng::sqlite3BtreeMoveto(cursorSlots_[i].cursor, nullptr, intKey, &compare);
+        } else {
+            eng::sqlite3BtreeMoveto(cursorSlots_[i].cursor, key.data(),
+                                    static_cast<std::int64_t>(key.size()), &compare);
+        }
+    }
+}
+
+void KovPager::teardown() {
+    if (engine_ != nullptr) {
+        eng::sqlite3BtreeClose(engine_);
+        engine_ = nullptr;
+    }
+    // Closing the engine left the registered cursors inert; free them.
+    for (CursorSlot& slot : cursorSlots_) {
+        if (slot.cursor != nullptr)
+            eng::sqlite3BtreeCloseCursor(slot.cursor);
+        slot.cursor = nullptr;
+    }
+    if (eng::temporaryDirectorySetting() == tempDir_.data()) {
+        eng::temporaryDirectorySetting() = nullptr;
+    }
+    std::string().swap(tempDir_);
+    std::vector<CursorSlot>().swap(cursorSlots_);
+}
+
+// Test seams.
+
+const std::vector<CursorSlot>& KovPager::TEST_slots() {
+    return instance()->cursorSlots_;
+}
+
+eng::Btree* KovPager::TEST_engine() {
+    return instance()->engine_;
+}
+
+std::string& KovPager::TEST_tempDir(KovPager* pager) {
+    return pager->tempDir_;
+}
+
+void KovPager::TEST_teardown() {
+    instance()->teardown();
+}
+
+void KovPager::TEST_closeAllCursors(std::vector<std::string>& saved) {
+    instance()->closeAllCursors(saved);
+}
+
+void KovPager::TEST_restoreAllCursors(const std::vector<std::string>& saved) {
+    instance()->restoreAllCursors(saved);
+}
+
+void KovPager::TEST_disposeCopy(KovPager* copy) {
+    if (copy == nullptr || copy == gPager)
+        return;
+    // A copy shares the engine and the engine cursors without owning them: detach before the
+    // destructor's teardown so nothing of the process's pager is closed.
+    copy->engine_ = nullptr;
+    copy->cursorSlots_.clear();
+    copy->~KovPager();
+}

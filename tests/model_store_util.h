@@ -1,0 +1,91 @@
+// Helpers for the store's tests: string-based wrappers over the cursor's pointer-and-size
+// interface, and a fixture that starts every test on an open engine with an empty registry.
+#ifndef KOVPAGER_TESTS_MODEL_STORE_UTIL_H
+#define KOVPAGER_TESTS_MODEL_STORE_UTIL_H
+
+#include <gtest/gtest.h>
+
+#include <cstdint>
+#include <cstring>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include <kovpager/KovBtree.h>
+#include <kovpager/KovBtreeCursor.h>
+#include <kovpager/KovPager.h>
+
+namespace kovtest {
+
+constexpr std::uint32_t kFreeSlot = 0xFFFFFFFFu;
+
+inline void insertBytes(KovBtreeCursor& c, const std::string& key, const std::string& data) {
+    c.insert(key.data(), key.size(), data.data(), data.size());
+}
+
+inline void insertKey(KovBtreeCursor& c, const std::string& key) {
+    c.insert(key.data(), key.size());
+}
+
+inline void insertInt(KovBtreeCursor& c, std::int64_t key, const std::string& data) {
+    c.insert(key, data.data(), data.size());
+}
+
+inline std::int32_t seekBytes(KovBtreeCursor& c, const std::string& key) {
+    return c.seek(key.data(), key.size());
+}
+
+inline std::int64_t intKey(KovBtreeCursor& c) {
+    std::int64_t k = -12345;
+    c.key(k);
+    return k;
+}
+
+// The current byte-string key, read with the test seam of the private key reader.
+inline std::string byteKey(KovBtreeCursor& c) {
+    std::string k(static_cast<std::size_t>(c.TEST_keySize()), '\0');
+    c.TEST_key(k.data(), k.size());
+    return k;
+}
+
+inline std::string dataOf(KovBtreeCursor& c) {
+    std::string d(static_cast<std::size_t>(c.dataSize()), '\0');
+    c.data(d.data(), d.size());
+    return d;
+}
+
+// Every (key, data) pair of a byte-string table, walked forward.
+inline std::vector<std::pair<std::string, std::string>> walkBytes(KovBtreeCursor& c) {
+    std::vector<std::pair<std::string, std::string>> out;
+    for (bool on = c.first(); on; on = c.next())
+        out.emplace_back(byteKey(c), dataOf(c));
+    return out;
+}
+
+inline std::vector<std::pair<std::int64_t, std::string>> walkInts(KovBtreeCursor& c) {
+    std::vector<std::pair<std::int64_t, std::string>> out;
+    for (bool on = c.first(); on; on = c.next())
+        out.emplace_back(intKey(c), dataOf(c));
+    return out;
+}
+
+inline const CursorSlot& slotOf(const KovBtreeCursor& c) {
+    return KovPager::TEST_slots().at(static_cast<std::size_t>(c.TEST_slotIndex()));
+}
+
+// Every test starts on an open engine with no registered cursor. A test that leaves slots behind
+// on purpose (after reset) ends with KovPager::TEST_teardown().
+class StoreTest : public ::testing::Test {
+  protected:
+    void SetUp() override {
+        KovPager::instance()->reset();
+        KovBtree opener(KovBtree::IndexTable);  // reopens the engine
+        ASSERT_TRUE(KovPager::TEST_slots().empty());
+        ASSERT_NE(KovPager::TEST_engine(), nullptr);
+    }
+    void TearDown() override { EXPECT_TRUE(KovPager::TEST_slots().empty()); }
+};
+
+}  // namespace kovtest
+
+#endif  // KOVPAGER_TESTS_MODEL_STORE_UTIL_H
