@@ -48,11 +48,9 @@ class KOVPAGER_EXPORT KovBtree {
     KovBtree(const KovBtree&) = delete;
     KovBtree& operator=(const KovBtree&) = delete;
 
-    // Test seam: the table's root page (0 when the engine refused to create it).
-    std::uint32_t TEST_rootPage() const { return rootPage_; }
-
   private:
     friend class KovBtreeCursor;
+    friend struct KovTestAccess;  // the unit tests only; never defined by the library
 
     KovPager* pager_;
     std::uint32_t rootPage_;

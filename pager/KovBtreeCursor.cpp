@@ -7,6 +7,7 @@
 #include <kovpager/KovBtreeCursor.h>
 
 #include <cstring>
+#include <memory>
 
 #include "engine/btree.h"
 
@@ -146,26 +147,58 @@ bool KovBtreeCursor::indexKeySeek(const void* key, std::uint64_t size) {
     return none == 0;
 }
 
+// Composite keys live on byte-string tables; on an integer-keyed table the "key length" the
+// engine reports is the integer key itself, so no fetch is attempted there.
 bool KovBtreeCursor::indexKeyFetch(const void* prefix, std::uint64_t prefixSize, void* payload,
                                    std::uint64_t payloadSize) {
+    if (onIntegerTable())
+        return false;
     const std::int64_t keyLength = keySize();
     if (static_cast<std::uint64_t>(keyLength) != prefixSize + payloadSize)
         return false;
-    std::string whole(static_cast<std::size_t>(keyLength), '\0');
-    key(whole.data(), whole.size());
-    if (prefixSize > 0 && std::memcmp(whole.data(), prefix, prefixSize) != 0)
-        return false;
-    if (payloadSize > 0)
-        std::memcpy(payload, whole.data() + prefixSize, payloadSize);
-    return true;
+    return fetchPayload(prefix, prefixSize, payload, payloadSize);
 }
 
 bool KovBtreeCursor::indexKeyFetch(const void* prefix, std::uint64_t prefixSize,
                                    std::string& payload) {
+    if (onIntegerTable())
+        return false;
     const std::int64_t keyLength = keySize();
     // A key shorter than the prefix cannot begin with it (this covers a cursor on no entry).
     if (keyLength < 0 || static_cast<std::uint64_t>(keyLength) < prefixSize)
         return false;
     payload.resize(static_cast<std::size_t>(static_cast<std::uint64_t>(keyLength) - prefixSize));
-    return indexKeyFetch(prefix, prefixSize, payload.data(), payload.size());
+    return fetchPayload(prefix, prefixSize, payload.data(), payload.size());
+}
+
+// The current key is prefixSize + payloadSize bytes long. Its first prefixSize bytes are read
+// into a zero-filled scratch buffer of this operation's own (on the stack for the short
+// prefixes composite keys use) and compared; only on a match is the rest of the key read, straight
+// into the caller's payload buffer, which a mismatch leaves untouched.
+bool KovBtreeCursor::fetchPayload(const void* prefix, std::uint64_t prefixSize, void* payload,
+                                  std::uint64_t payloadSize) {
+    eng::BtCursor* cursor = handle();
+    if (prefixSize > 0) {
+        unsigned char local[64];
+        std::unique_ptr<unsigned char[]> large;
+        unsigned char* scratch = local;
+        if (prefixSize > sizeof local) {
+            large.reset(new unsigned char[static_cast<std::size_t>(prefixSize)]);
+            scratch = large.get();
+        }
+        std::memset(scratch, 0, static_cast<std::size_t>(prefixSize));
+        eng::sqlite3BtreeKey(cursor, 0, static_cast<std::uint32_t>(prefixSize), scratch);
+        if (std::memcmp(scratch, prefix, static_cast<std::size_t>(prefixSize)) != 0)
+            return false;
+    }
+    if (payloadSize > 0) {
+        eng::sqlite3BtreeKey(cursor, static_cast<std::uint32_t>(prefixSize),
+                             static_cast<std::uint32_t>(payloadSize), payload);
+    }
+    return true;
+}
+
+bool KovBtreeCursor::onIntegerTable() const {
+    return slotIndex_ < registry_->size() &&
+           ((*registry_)[slotIndex_].tableFlags & eng::BTREE_INTKEY) != 0;
 }

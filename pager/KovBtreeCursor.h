@@ -115,23 +115,16 @@ class KOVPAGER_EXPORT KovBtreeCursor {
     // True when the current key begins with the `prefixSize` bytes at `prefix`; `payload` is then
     // the rest of the key. False when it does not: `payload` has then been resized to the rest's
     // length and holds its old leading bytes padded with zero bytes. False, with `payload`
-    // untouched, when the key is shorter than the prefix. On no entry the key reads as empty:
-    // a non-empty prefix gives false, the empty prefix true with an empty payload.
+    // untouched, when the key is shorter than the prefix, and on an IntKeyTable (whose keys are
+    // numbers, not bytes). On no entry the key reads as empty: a non-empty prefix gives false,
+    // the empty prefix true with an empty payload.
     // A group of entries sharing a prefix is walked as
     //   for (bool on = c.indexKeySeek(p, n); on && c.indexKeyFetch(p, n, out); on = c.next()) ...
     bool indexKeyFetch(const void* prefix, std::uint64_t prefixSize, std::string& payload);
 
-    // Test seams: the private readers and the slot index.
-    void TEST_key(void* buffer, std::uint64_t size) { key(buffer, size); }
-    std::int64_t TEST_keySize() { return keySize(); }
-    void TEST_dataBuf(void* buffer, std::uint64_t size) { dataBuf(buffer, size); }
-    bool TEST_indexKeyFetch(const void* prefix, std::uint64_t prefixSize, void* payload,
-                            std::uint64_t payloadSize) {
-        return indexKeyFetch(prefix, prefixSize, payload, payloadSize);
-    }
-    std::uint64_t TEST_slotIndex() const { return slotIndex_; }
-
   private:
+    friend struct KovTestAccess;  // the unit tests only; never defined by the library
+
     // Copies the first `size` bytes of key-then-data of a byte-string entry; nothing on an
     // integer-keyed table, on no entry, or when `size` exceeds key plus data.
     void key(void* buffer, std::uint64_t size);
@@ -149,6 +142,13 @@ class KOVPAGER_EXPORT KovBtreeCursor {
 
     // The engine cursor in this cursor's slot; null when refused or after the pager's teardown.
     kov::engine::BtCursor* handle() const;
+
+    // The two indexKeyFetch forms once the key length is known to be prefixSize + payloadSize.
+    bool fetchPayload(const void* prefix, std::uint64_t prefixSize, void* payload,
+                      std::uint64_t payloadSize);
+
+    // True when this cursor's table has integer keys (composite keys are never fetched there).
+    bool onIntegerTable() const;
 
     std::vector<CursorSlot>* registry_;
     std::uint64_t slotIndex_;

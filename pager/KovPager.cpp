@@ -193,39 +193,3 @@ void KovPager::teardown() {
     std::string().swap(tempDir_);
     std::vector<CursorSlot>().swap(cursorSlots_);
 }
-
-// Test seams.
-
-const std::vector<CursorSlot>& KovPager::TEST_slots() {
-    return instance()->cursorSlots_;
-}
-
-eng::Btree* KovPager::TEST_engine() {
-    return instance()->engine_;
-}
-
-std::string& KovPager::TEST_tempDir(KovPager* pager) {
-    return pager->tempDir_;
-}
-
-void KovPager::TEST_teardown() {
-    instance()->teardown();
-}
-
-void KovPager::TEST_closeAllCursors(std::vector<std::string>& saved) {
-    instance()->closeAllCursors(saved);
-}
-
-void KovPager::TEST_restoreAllCursors(const std::vector<std::string>& saved) {
-    instance()->restoreAllCursors(saved);
-}
-
-void KovPager::TEST_disposeCopy(KovPager* copy) {
-    if (copy == nullptr || copy == gPager)
-        return;
-    // A copy shares the engine and the engine cursors without owning them: detach before the
-    // destructor's teardown so nothing of the process's pager is closed.
-    copy->engine_ = nullptr;
-    copy->cursorSlots_.clear();
-    copy->~KovPager();
-}

@@ -82,18 +82,12 @@ class KOVPAGER_EXPORT KovPager {
     // process's pager, the engine's directory setting follows the new text.
     KovPager& operator=(const KovPager& other);
 
-    // Test seams: not part of the supported interface.
-    static const std::vector<CursorSlot>& TEST_slots();
-    static kov::engine::Btree* TEST_engine();
-    static std::string& TEST_tempDir(KovPager* pager);
-    static void TEST_teardown();
-    static void TEST_closeAllCursors(std::vector<std::string>& saved);
-    static void TEST_restoreAllCursors(const std::vector<std::string>& saved);
-    static void TEST_disposeCopy(KovPager* copy);
-
   private:
     friend class KovBtree;
     friend class KovBtreeCursor;
+    // The unit tests' window on the private state. Declared here, defined only by the tests; the
+    // library neither defines nor exports it.
+    friend struct KovTestAccess;
 
     KovPager();
     ~KovPager();

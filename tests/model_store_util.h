@@ -15,6 +15,8 @@
 #include <kovpager/KovBtreeCursor.h>
 #include <kovpager/KovPager.h>
 
+#include "kov_test_access.h"
+
 namespace kovtest {
 
 constexpr std::uint32_t kFreeSlot = 0xFFFFFFFFu;
@@ -43,8 +45,8 @@ inline std::int64_t intKey(KovBtreeCursor& c) {
 
 // The current byte-string key, read with the test seam of the private key reader.
 inline std::string byteKey(KovBtreeCursor& c) {
-    std::string k(static_cast<std::size_t>(c.TEST_keySize()), '\0');
-    c.TEST_key(k.data(), k.size());
+    std::string k(static_cast<std::size_t>(KovTestAccess::keySize(c)), '\0');
+    KovTestAccess::key(c, k.data(), k.size());
     return k;
 }
 
@@ -70,20 +72,20 @@ inline std::vector<std::pair<std::int64_t, std::string>> walkInts(KovBtreeCursor
 }
 
 inline const CursorSlot& slotOf(const KovBtreeCursor& c) {
-    return KovPager::TEST_slots().at(static_cast<std::size_t>(c.TEST_slotIndex()));
+    return KovTestAccess::slots().at(static_cast<std::size_t>(KovTestAccess::slotIndex(c)));
 }
 
 // Every test starts on an open engine with no registered cursor. A test that leaves slots behind
-// on purpose (after reset) ends with KovPager::TEST_teardown().
+// on purpose (after reset) ends with KovTestAccess::teardown().
 class StoreTest : public ::testing::Test {
   protected:
     void SetUp() override {
         KovPager::instance()->reset();
         KovBtree opener(KovBtree::IndexTable);  // reopens the engine
-        ASSERT_TRUE(KovPager::TEST_slots().empty());
-        ASSERT_NE(KovPager::TEST_engine(), nullptr);
+        ASSERT_TRUE(KovTestAccess::slots().empty());
+        ASSERT_NE(KovTestAccess::engine(), nullptr);
     }
-    void TearDown() override { EXPECT_TRUE(KovPager::TEST_slots().empty()); }
+    void TearDown() override { EXPECT_TRUE(KovTestAccess::slots().empty()); }
 };
 
 }  // namespace kovtest

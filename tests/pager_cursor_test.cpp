@@ -228,7 +228,7 @@ TYPED_TEST(CursorSuite, SizesReadZeroOnNoEntry) {
     ASSERT_FALSE(c.next());
     EXPECT_EQ(intKey(c), 0);
     EXPECT_EQ(c.dataSize(), 0);
-    EXPECT_EQ(c.TEST_keySize(), 0);
+    EXPECT_EQ(KovTestAccess::keySize(c), 0);
     std::string buf(4, '.');
     c.data(buf.data(), 1);
     EXPECT_EQ(buf, "....");
@@ -271,14 +271,14 @@ TYPED_TEST(CursorSuite, ManyCursorsGrowTheRegistryAndEachKeepsItsSlot) {
     std::vector<std::unique_ptr<KovBtreeCursor>> cursors;
     for (int i = 0; i < 100; ++i) {
         cursors.push_back(std::make_unique<KovBtreeCursor>(*this->table, true));
-        ASSERT_EQ(cursors.back()->TEST_slotIndex(), static_cast<std::uint64_t>(i + 1));
+        ASSERT_EQ(KovTestAccess::slotIndex(*cursors.back()), static_cast<std::uint64_t>(i + 1));
         TypeParam::seek(*cursors.back(), 2 * (i % 10));
     }
     for (int i = 0; i < 100; ++i)
         EXPECT_EQ(TypeParam::current(*cursors[i]), 2 * (i % 10));
-    EXPECT_EQ(KovPager::TEST_slots().size(), 101u);
+    EXPECT_EQ(KovTestAccess::slots().size(), 101u);
     cursors.clear();
-    EXPECT_EQ(KovPager::TEST_slots().size(), 1u);
+    EXPECT_EQ(KovTestAccess::slots().size(), 1u);
 }
 
 }  // namespace

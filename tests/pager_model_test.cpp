@@ -88,7 +88,7 @@ class ModelRun {
     void run(int steps) {
         KovPager::instance()->reset();
         // A clean start: an empty registry and a fresh engine.
-        KovPager::TEST_teardown();
+        KovTestAccess::teardown();
         engineOpen_ = false;
         for (step_ = 0; step_ < steps && !::testing::Test::HasFatalFailure(); ++step_) {
             oneStep();
@@ -98,7 +98,7 @@ class ModelRun {
         }
         cursors_.clear();
         tables_.clear();
-        KovPager::TEST_teardown();
+        KovTestAccess::teardown();
     }
 
   private:
@@ -230,7 +230,7 @@ class ModelRun {
         }
         auto host = std::make_unique<HostTable>();
         host->obj = std::make_unique<KovBtree>(static_cast<KovBtree::TableType>(kind));
-        host->root = host->obj->TEST_rootPage();
+        host->root = KovTestAccess::rootPage(*host->obj);
         host->flags = flagsOfKind(kind);
         host->generation = generation_;
         ASSERT_NE(host->root, 0u) << where();
@@ -298,7 +298,7 @@ class ModelRun {
         c->obj = std::make_unique<KovBtreeCursor>(*t->obj, write);
         c->slot = slots_.size();
         c->generation = generation_;
-        ASSERT_EQ(c->obj->TEST_slotIndex(), slots_.size()) << where();
+        ASSERT_EQ(KovTestAccess::slotIndex(*c->obj), slots_.size()) << where();
         slots_.push_back(s);
         cursors_.push_back(std::move(c));
     }
@@ -495,7 +495,7 @@ class ModelRun {
             std::string whole = s.bk + data;
             std::size_t n = static_cast<std::size_t>(pick(static_cast<int>(whole.size()) + 2));
             std::string kb(n, '#');
-            c.obj->TEST_key(kb.data(), n);
+            KovTestAccess::key(*c.obj, kb.data(), n);
             EXPECT_EQ(kb, n <= whole.size() ? whole.substr(0, n) : std::string(n, '#')) << where();
         }
     }
@@ -632,8 +632,8 @@ class ModelRun {
     }
 
     void check() {
-        ASSERT_EQ(KovPager::TEST_engine() != nullptr, engineOpen_) << where();
-        const auto& real = KovPager::TEST_slots();
+        ASSERT_EQ(KovTestAccess::engine() != nullptr, engineOpen_) << where();
+        const auto& real = KovTestAccess::slots();
         ASSERT_EQ(real.size(), slots_.size()) << where();
         for (std::size_t i = 0; i < real.size(); ++i) {
             const ModelSlot& s = slots_[i];

@@ -14,11 +14,11 @@ TEST(PagerTeardown, ResetThenDestroyingACursorLeavesItsSlotLive) {
     KovPager::instance()->reset();
     {
         KovBtree t(KovBtree::IntKeyTable);
-        ASSERT_TRUE(KovPager::TEST_slots().empty());
+        ASSERT_TRUE(KovTestAccess::slots().empty());
         KovBtreeCursor c(t, true);
         insertInt(c, 1, "one");
         KovPager::instance()->reset();
-        EXPECT_EQ(KovPager::TEST_engine(), nullptr);
+        EXPECT_EQ(KovTestAccess::engine(), nullptr);
         // The cursor is inert: it answers "no entry".
         EXPECT_FALSE(c.first());
         EXPECT_FALSE(c.good());
@@ -26,21 +26,21 @@ TEST(PagerTeardown, ResetThenDestroyingACursorLeavesItsSlotLive) {
         EXPECT_LT(c.seek(std::int64_t{1}), 0);
         insertInt(c, 2, "refused");
     }
-    ASSERT_EQ(KovPager::TEST_slots().size(), 1u);
-    EXPECT_NE(KovPager::TEST_slots()[0].rootPage, kFreeSlot);
-    EXPECT_NE(KovPager::TEST_slots()[0].cursor, nullptr);
+    ASSERT_EQ(KovTestAccess::slots().size(), 1u);
+    EXPECT_NE(KovTestAccess::slots()[0].rootPage, kFreeSlot);
+    EXPECT_NE(KovTestAccess::slots()[0].cursor, nullptr);
 
     // A later table creation saves and closes the stale cursor, then reopens the slot in the new
     // engine: the slot stays live, and nothing leaks.
     KovBtree fresh(KovBtree::IntKeyTable);
-    ASSERT_EQ(KovPager::TEST_slots().size(), 1u);
-    EXPECT_NE(KovPager::TEST_slots()[0].rootPage, kFreeSlot);
+    ASSERT_EQ(KovTestAccess::slots().size(), 1u);
+    EXPECT_NE(KovTestAccess::slots()[0].rootPage, kFreeSlot);
     KovBtreeCursor reader(fresh, false);
     EXPECT_FALSE(reader.first());
 
-    KovPager::TEST_teardown();
-    EXPECT_TRUE(KovPager::TEST_slots().empty());
-    EXPECT_EQ(KovPager::TEST_engine(), nullptr);
+    KovTestAccess::teardown();
+    EXPECT_TRUE(KovTestAccess::slots().empty());
+    EXPECT_EQ(KovTestAccess::engine(), nullptr);
 }
 
 TEST(PagerTeardown, TeardownClosesEverythingAndLaterHostObjectsDoNothing) {
@@ -49,14 +49,14 @@ TEST(PagerTeardown, TeardownClosesEverythingAndLaterHostObjectsDoNothing) {
     insertBytes(*writer, "k", "v");
     auto reader = std::make_unique<KovBtreeCursor>(*table, false);
     ASSERT_TRUE(reader->first());
-    ASSERT_FALSE(KovPager::TEST_slots().empty());
+    ASSERT_FALSE(KovTestAccess::slots().empty());
 
-    KovPager::TEST_teardown();
-    EXPECT_EQ(KovPager::TEST_engine(), nullptr);
-    EXPECT_TRUE(KovPager::TEST_slots().empty());
-    EXPECT_EQ(KovPager::TEST_slots().capacity(), 0u);
+    KovTestAccess::teardown();
+    EXPECT_EQ(KovTestAccess::engine(), nullptr);
+    EXPECT_TRUE(KovTestAccess::slots().empty());
+    EXPECT_EQ(KovTestAccess::slots().capacity(), 0u);
     EXPECT_EQ(kov::engine::temporaryDirectorySetting(), nullptr);
-    EXPECT_TRUE(KovPager::TEST_tempDir(KovPager::instance()).empty());
+    EXPECT_TRUE(KovTestAccess::tempDir(KovPager::instance()).empty());
 
     // Host objects that outlive the teardown find no engine and no slot: every operation reports
     // "no entry" and destruction does nothing.
@@ -69,12 +69,12 @@ TEST(PagerTeardown, TeardownClosesEverythingAndLaterHostObjectsDoNothing) {
     reader.reset();
     writer.reset();
     table.reset();
-    EXPECT_TRUE(KovPager::TEST_slots().empty());
-    EXPECT_EQ(KovPager::TEST_engine(), nullptr);
+    EXPECT_TRUE(KovTestAccess::slots().empty());
+    EXPECT_EQ(KovTestAccess::engine(), nullptr);
 
     // Teardown twice is harmless.
-    KovPager::TEST_teardown();
-    EXPECT_EQ(KovPager::TEST_engine(), nullptr);
+    KovTestAccess::teardown();
+    EXPECT_EQ(KovTestAccess::engine(), nullptr);
 }
 
 // A slot registered on a byte-string table before a reset can be reopened, in the new engine, on
@@ -85,15 +85,15 @@ TEST(PagerTeardown, StaleByteSlotOnAnIntegerTableSavesAnEmptyKey) {
     KovPager::instance()->reset();
     {
         KovBtree blobs(KovBtree::BlobTable);
-        oldRoot = blobs.TEST_rootPage();
+        oldRoot = KovTestAccess::rootPage(blobs);
         KovBtreeCursor stale(blobs, false);
         KovPager::instance()->reset();
     }  // the slot stays live, with byte-string flags
-    ASSERT_EQ(KovPager::TEST_slots().size(), 1u);
-    EXPECT_EQ(KovPager::TEST_slots()[0].tableFlags, 0u);
+    ASSERT_EQ(KovTestAccess::slots().size(), 1u);
+    EXPECT_EQ(KovTestAccess::slots()[0].tableFlags, 0u);
 
     KovBtree ints(KovBtree::IntKeyTable);  // a fresh engine: the first table gets the same root
-    ASSERT_EQ(ints.TEST_rootPage(), oldRoot);
+    ASSERT_EQ(KovTestAccess::rootPage(ints), oldRoot);
     {
         KovBtreeCursor w(ints, true);
         insertInt(w, INT64_C(1) << 50, "far");
@@ -102,11 +102,11 @@ TEST(PagerTeardown, StaleByteSlotOnAnIntegerTableSavesAnEmptyKey) {
         KovBtree second(KovBtree::BlobTable);  // the stale slot is searched onto key 2^50
     }
     std::vector<std::string> saved;
-    KovPager::TEST_closeAllCursors(saved);
+    KovTestAccess::closeAllCursors(saved);
     ASSERT_EQ(saved.size(), 1u);
     EXPECT_EQ(saved[0], "");
-    KovPager::TEST_restoreAllCursors(saved);
+    KovTestAccess::restoreAllCursors(saved);
     KovBtree third(KovBtree::IndexTable);
-    EXPECT_EQ(KovPager::TEST_slots().size(), 1u);
-    KovPager::TEST_teardown();
+    EXPECT_EQ(KovTestAccess::slots().size(), 1u);
+    KovTestAccess::teardown();
 }

@@ -22,7 +22,7 @@ using namespace kovtest;
 namespace {
 
 std::int64_t pragmaValue(const char* pragma) {
-    sqlite3* db = kov::engine::TEST_connection(KovPager::TEST_engine());
+    sqlite3* db = kov::engine::TEST_connection(KovTestAccess::engine());
     sqlite3_stmt* stmt = nullptr;
     std::int64_t value = -1;
     if (sqlite3_prepare_v2(db, pragma, -1, &stmt, nullptr) == SQLITE_OK &&
@@ -66,7 +66,7 @@ TEST(Pager, InstanceFromTwoThreadsIsOnePagerWithOneEngine) {
     // Run first in its process (as ctest runs it), the construction opened the engine; after an
     // earlier test's reset, the next table opens it.
     KovBtree table(KovBtree::IntKeyTable);
-    EXPECT_NE(KovPager::TEST_engine(), nullptr);
+    EXPECT_NE(KovTestAccess::engine(), nullptr);
 }
 
 TEST(Pager, EngineOpensWithFixedPageAndCacheSizes) {
@@ -77,17 +77,17 @@ TEST(Pager, EngineOpensWithFixedPageAndCacheSizes) {
 
 TEST(Pager, EngineDirectorySettingIsThePagersOwnCopy) {
     KovPager* pager = KovPager::instance();
-    const std::string& dir = KovPager::TEST_tempDir(pager);
+    const std::string& dir = KovTestAccess::tempDir(pager);
     EXPECT_EQ(dir, kov::getTempDirectory());
     EXPECT_EQ(kov::engine::temporaryDirectorySetting(), dir.c_str());
 }
 
 TEST_F(StoreTest, CloseAllOnEmptyRegistryEmptiesSavedAndRestoreDoesNothing) {
     std::vector<std::string> saved{"left", "over"};
-    KovPager::TEST_closeAllCursors(saved);
+    KovTestAccess::closeAllCursors(saved);
     EXPECT_TRUE(saved.empty());
-    KovPager::TEST_restoreAllCursors(saved);
-    EXPECT_TRUE(KovPager::TEST_slots().empty());
+    KovTestAccess::restoreAllCursors(saved);
+    EXPECT_TRUE(KovTestAccess::slots().empty());
 }
 
 TEST_F(StoreTest, UnpositionedAndPastEndCursorsAreSavedAsZeroOrEmptyKey) {
@@ -104,14 +104,14 @@ TEST_F(StoreTest, UnpositionedAndPastEndCursorsAreSavedAsZeroOrEmptyKey) {
     ASSERT_FALSE(pastEndBytes.next());
 
     std::vector<std::string> saved;
-    KovPager::TEST_closeAllCursors(saved);
+    KovTestAccess::closeAllCursors(saved);
     ASSERT_EQ(saved.size(), 4u);
     EXPECT_EQ(saved[2], bytes8(0));
     EXPECT_EQ(saved[3], "");
-    for (const CursorSlot& s : KovPager::TEST_slots())
+    for (const CursorSlot& s : KovTestAccess::slots())
         EXPECT_EQ(s.cursor, nullptr);
-    KovPager::TEST_restoreAllCursors(saved);
-    for (const CursorSlot& s : KovPager::TEST_slots())
+    KovTestAccess::restoreAllCursors(saved);
+    for (const CursorSlot& s : KovTestAccess::slots())
         EXPECT_NE(s.cursor, nullptr);
 
     // Searched for 0 and for the empty key: on a non-empty table they come back on an entry.
@@ -142,10 +142,10 @@ TEST_F(StoreTest, IntegerCursorOnMinusOneIsSavedAsAllOnesAndComesBack) {
     ASSERT_EQ(c.seek(std::int64_t{-1}), 0);
 
     std::vector<std::string> saved;
-    KovPager::TEST_closeAllCursors(saved);
+    KovTestAccess::closeAllCursors(saved);
     ASSERT_EQ(saved.size(), 1u);
     EXPECT_EQ(saved[0], std::string(8, '\xFF'));
-    KovPager::TEST_restoreAllCursors(saved);
+    KovTestAccess::restoreAllCursors(saved);
     EXPECT_TRUE(c.good());
     EXPECT_EQ(intKey(c), -1);
     EXPECT_EQ(dataOf(c), "minus one");
@@ -201,26 +201,26 @@ TEST_F(StoreTest, FreeSlotsKeepTheirPlacesUntilTheyTrail) {
     auto a = std::make_unique<KovBtreeCursor>(t, true);
     auto b = std::make_unique<KovBtreeCursor>(t, true);
     auto c = std::make_unique<KovBtreeCursor>(t, true);
-    EXPECT_EQ(a->TEST_slotIndex(), 0u);
-    EXPECT_EQ(b->TEST_slotIndex(), 1u);
-    EXPECT_EQ(c->TEST_slotIndex(), 2u);
+    EXPECT_EQ(KovTestAccess::slotIndex(*a), 0u);
+    EXPECT_EQ(KovTestAccess::slotIndex(*b), 1u);
+    EXPECT_EQ(KovTestAccess::slotIndex(*c), 2u);
     b.reset();
-    ASSERT_EQ(KovPager::TEST_slots().size(), 3u);
-    EXPECT_EQ(KovPager::TEST_slots()[1].rootPage, kFreeSlot);
-    EXPECT_EQ(KovPager::TEST_slots()[1].cursor, nullptr);
-    EXPECT_EQ(KovPager::TEST_slots()[1].tableFlags, 0u);
-    EXPECT_EQ(KovPager::TEST_slots()[2].rootPage, t.TEST_rootPage());
+    ASSERT_EQ(KovTestAccess::slots().size(), 3u);
+    EXPECT_EQ(KovTestAccess::slots()[1].rootPage, kFreeSlot);
+    EXPECT_EQ(KovTestAccess::slots()[1].cursor, nullptr);
+    EXPECT_EQ(KovTestAccess::slots()[1].tableFlags, 0u);
+    EXPECT_EQ(KovTestAccess::slots()[2].rootPage, KovTestAccess::rootPage(t));
 
     // A new cursor goes at the end, never into the free slot.
     auto d = std::make_unique<KovBtreeCursor>(t, true);
-    EXPECT_EQ(d->TEST_slotIndex(), 3u);
+    EXPECT_EQ(KovTestAccess::slotIndex(*d), 3u);
     d.reset();
-    ASSERT_EQ(KovPager::TEST_slots().size(), 3u);
+    ASSERT_EQ(KovTestAccess::slots().size(), 3u);
 
     c.reset();
-    ASSERT_EQ(KovPager::TEST_slots().size(), 1u);
+    ASSERT_EQ(KovTestAccess::slots().size(), 1u);
     a.reset();
-    EXPECT_TRUE(KovPager::TEST_slots().empty());
+    EXPECT_TRUE(KovTestAccess::slots().empty());
 }
 
 TEST_F(StoreTest, SlotCopiesRootPageAndFlagsOfItsTable) {
@@ -230,59 +230,59 @@ TEST_F(StoreTest, SlotCopiesRootPageAndFlagsOfItsTable) {
     KovBtreeCursor ci(ints, false);
     KovBtreeCursor cb(blobs, false);
     KovBtreeCursor cx(index, false);
-    EXPECT_EQ(slotOf(ci).rootPage, ints.TEST_rootPage());
+    EXPECT_EQ(slotOf(ci).rootPage, KovTestAccess::rootPage(ints));
     EXPECT_EQ(slotOf(ci).tableFlags, 5u);
-    EXPECT_EQ(slotOf(cb).rootPage, blobs.TEST_rootPage());
+    EXPECT_EQ(slotOf(cb).rootPage, KovTestAccess::rootPage(blobs));
     EXPECT_EQ(slotOf(cb).tableFlags, 0u);
-    EXPECT_EQ(slotOf(cx).rootPage, index.TEST_rootPage());
+    EXPECT_EQ(slotOf(cx).rootPage, KovTestAccess::rootPage(index));
     EXPECT_EQ(slotOf(cx).tableFlags, 2u);
-    EXPECT_NE(ints.TEST_rootPage(), blobs.TEST_rootPage());
+    EXPECT_NE(KovTestAccess::rootPage(ints), KovTestAccess::rootPage(blobs));
 }
 
 TEST_F(StoreTest, ResetTwiceInARowDoesNothingMore) {
     KovBtree t(KovBtree::BlobTable);
     KovPager::instance()->reset();
-    EXPECT_EQ(KovPager::TEST_engine(), nullptr);
-    const std::string dir = KovPager::TEST_tempDir(KovPager::instance());
+    EXPECT_EQ(KovTestAccess::engine(), nullptr);
+    const std::string dir = KovTestAccess::tempDir(KovPager::instance());
     KovPager::instance()->reset();
-    EXPECT_EQ(KovPager::TEST_engine(), nullptr);
-    EXPECT_EQ(KovPager::TEST_tempDir(KovPager::instance()), dir);
-    EXPECT_TRUE(KovPager::TEST_slots().empty());
+    EXPECT_EQ(KovTestAccess::engine(), nullptr);
+    EXPECT_EQ(KovTestAccess::tempDir(KovPager::instance()), dir);
+    EXPECT_TRUE(KovTestAccess::slots().empty());
 }
 
 TEST_F(StoreTest, CopyAndAssignmentKeepTheEngineDirectorySettingValid) {
     KovPager* pager = KovPager::instance();
-    const std::string original = KovPager::TEST_tempDir(pager);
+    const std::string original = KovTestAccess::tempDir(pager);
     KovBtree t(KovBtree::IntKeyTable);
     KovBtreeCursor c(t, true);
-    kov::engine::Btree* const engine = KovPager::TEST_engine();
+    kov::engine::Btree* const engine = KovTestAccess::engine();
 
     alignas(KovPager) unsigned char storage[sizeof(KovPager)];
     KovPager* copy = new (storage) KovPager(*pager);
-    EXPECT_EQ(KovPager::TEST_tempDir(copy), original);
-    EXPECT_EQ(kov::engine::temporaryDirectorySetting(), KovPager::TEST_tempDir(pager).c_str());
+    EXPECT_EQ(KovTestAccess::tempDir(copy), original);
+    EXPECT_EQ(kov::engine::temporaryDirectorySetting(), KovTestAccess::tempDir(pager).c_str());
 
     // Self-assignment changes nothing.
     *pager = *pager;
-    EXPECT_EQ(KovPager::TEST_tempDir(pager), original);
-    EXPECT_EQ(KovPager::TEST_slots().size(), 1u);
-    EXPECT_EQ(KovPager::TEST_engine(), engine);
+    EXPECT_EQ(KovTestAccess::tempDir(pager), original);
+    EXPECT_EQ(KovTestAccess::slots().size(), 1u);
+    EXPECT_EQ(KovTestAccess::engine(), engine);
 
     // A longer text moves the buffer; the setting follows it.
-    KovPager::TEST_tempDir(copy) = original + std::string(200, 'x');
+    KovTestAccess::tempDir(copy) = original + std::string(200, 'x');
     *pager = *copy;
-    EXPECT_EQ(KovPager::TEST_tempDir(pager), original + std::string(200, 'x'));
-    EXPECT_EQ(kov::engine::temporaryDirectorySetting(), KovPager::TEST_tempDir(pager).c_str());
-    EXPECT_EQ(KovPager::TEST_slots().size(), 1u);
+    EXPECT_EQ(KovTestAccess::tempDir(pager), original + std::string(200, 'x'));
+    EXPECT_EQ(kov::engine::temporaryDirectorySetting(), KovTestAccess::tempDir(pager).c_str());
+    EXPECT_EQ(KovTestAccess::slots().size(), 1u);
 
     // Assigning to the copy leaves the setting alone.
-    KovPager::TEST_tempDir(copy) = original;
+    KovTestAccess::tempDir(copy) = original;
     *copy = *copy;
-    EXPECT_EQ(kov::engine::temporaryDirectorySetting(), KovPager::TEST_tempDir(pager).c_str());
+    EXPECT_EQ(kov::engine::temporaryDirectorySetting(), KovTestAccess::tempDir(pager).c_str());
     *pager = *copy;
-    EXPECT_EQ(KovPager::TEST_tempDir(pager), original);
-    EXPECT_EQ(kov::engine::temporaryDirectorySetting(), KovPager::TEST_tempDir(pager).c_str());
-    KovPager::TEST_disposeCopy(copy);
+    EXPECT_EQ(KovTestAccess::tempDir(pager), original);
+    EXPECT_EQ(kov::engine::temporaryDirectorySetting(), KovTestAccess::tempDir(pager).c_str());
+    KovTestAccess::disposeCopy(copy);
 
     insertInt(c, 4, "still open");
     ASSERT_TRUE(c.first());
@@ -334,16 +334,16 @@ TEST_F(StoreTest, CreatingATableAfterResetOpensAFreshEngine) {
     {
         KovPager::instance()->reset();
         KovBtree first(KovBtree::IntKeyTable);
-        firstRoot = first.TEST_rootPage();
+        firstRoot = KovTestAccess::rootPage(first);
         KovBtreeCursor c(first, true);
         insertInt(c, 1, "gone soon");
     }
     KovPager::instance()->reset();
-    EXPECT_EQ(KovPager::TEST_engine(), nullptr);
+    EXPECT_EQ(KovTestAccess::engine(), nullptr);
     KovBtree again(KovBtree::IntKeyTable);
-    EXPECT_NE(KovPager::TEST_engine(), nullptr);
-    EXPECT_NE(again.TEST_rootPage(), 0u);
-    EXPECT_EQ(again.TEST_rootPage(), firstRoot);  // the first table of an empty database
+    EXPECT_NE(KovTestAccess::engine(), nullptr);
+    EXPECT_NE(KovTestAccess::rootPage(again), 0u);
+    EXPECT_EQ(KovTestAccess::rootPage(again), firstRoot);  // the first table of an empty database
     KovBtreeCursor c(again, false);
     EXPECT_FALSE(c.first());
 }
@@ -368,17 +368,17 @@ TEST_F(StoreTest, DestroyingATableWhileACursorIsOpenElsewhereKeepsIt) {
         KovBtreeCursor open(holder, false);
         {
             KovBtree doomed(KovBtree::IntKeyTable);
-            keptRoot = doomed.TEST_rootPage();
+            keptRoot = KovTestAccess::rootPage(doomed);
         }  // the drop is refused: a cursor is open
         KovBtree after(KovBtree::IntKeyTable);
-        nextRoot = after.TEST_rootPage();
+        nextRoot = KovTestAccess::rootPage(after);
         EXPECT_NE(nextRoot, keptRoot);  // the kept table's pages are not reused
     }
     // The kept table is still there: a cursor can be opened on its root page.
-    sqlite3* db = kov::engine::TEST_connection(KovPager::TEST_engine());
+    sqlite3* db = kov::engine::TEST_connection(KovTestAccess::engine());
     ASSERT_NE(db, nullptr);
     kov::engine::BtCursor* raw = nullptr;
-    EXPECT_EQ(kov::engine::sqlite3BtreeCursor(KovPager::TEST_engine(), keptRoot, 0, nullptr,
+    EXPECT_EQ(kov::engine::sqlite3BtreeCursor(KovTestAccess::engine(), keptRoot, 0, nullptr,
                                               nullptr, &raw),
               SQLITE_OK);
     ASSERT_NE(raw, nullptr);
@@ -389,15 +389,15 @@ TEST_F(StoreTest, DestroyingATableWithNoCursorOpenDropsIt) {
     std::uint32_t root = 0;
     {
         KovBtree t(KovBtree::IntKeyTable);
-        root = t.TEST_rootPage();
+        root = KovTestAccess::rootPage(t);
         KovBtreeCursor c(t, true);
         insertInt(c, 1, "x");
     }
     kov::engine::BtCursor* raw = nullptr;
-    kov::engine::sqlite3BtreeCursor(KovPager::TEST_engine(), root, 0, nullptr, nullptr, &raw);
+    kov::engine::sqlite3BtreeCursor(KovTestAccess::engine(), root, 0, nullptr, nullptr, &raw);
     EXPECT_EQ(raw, nullptr);  // no table has that root any more
     KovBtree reuse(KovBtree::IntKeyTable);
-    EXPECT_EQ(reuse.TEST_rootPage(), root);  // its page is free for the next table
+    EXPECT_EQ(KovTestAccess::rootPage(reuse), root);  // its page is free for the next table
     KovBtreeCursor c(reuse, false);
     EXPECT_FALSE(c.first());
 }
@@ -407,8 +407,8 @@ TEST_F(StoreTest, DestroyingATableAfterResetDoesNothing) {
         KovBtree t(KovBtree::IntKeyTable);
         KovPager::instance()->reset();
     }
-    EXPECT_EQ(KovPager::TEST_engine(), nullptr);
-    EXPECT_TRUE(KovPager::TEST_slots().empty());
+    EXPECT_EQ(KovTestAccess::engine(), nullptr);
+    EXPECT_TRUE(KovTestAccess::slots().empty());
 }
 
 // ---------------------------------------------------------------------------------------------
@@ -438,10 +438,10 @@ TEST_F(StoreTest, BufferReadsCopyExactlyWhatFitsAndNothingPastTheEntry) {
     ASSERT_TRUE(ci.first());
 
     std::string buf(7, '.');
-    cb.TEST_key(buf.data(), 7);  // key read continues into the data
+    KovTestAccess::key(cb, buf.data(), 7);  // key read continues into the data
     EXPECT_EQ(buf, "keyDATA");
     buf.assign(8, '.');
-    cb.TEST_key(buf.data(), 8);  // past key plus data: nothing
+    KovTestAccess::key(cb, buf.data(), 8);  // past key plus data: nothing
     EXPECT_EQ(buf, "........");
     buf.assign(2, '.');
     cb.data(buf.data(), 2);
@@ -450,13 +450,13 @@ TEST_F(StoreTest, BufferReadsCopyExactlyWhatFitsAndNothingPastTheEntry) {
     cb.data(buf.data(), 5);
     EXPECT_EQ(buf, ".....");
     buf.assign(4, '.');
-    cb.TEST_dataBuf(buf.data(), 4);
+    KovTestAccess::dataBuf(cb, buf.data(), 4);
     EXPECT_EQ(buf, "DATA");
 
     buf.assign(8, '.');
-    ci.TEST_key(buf.data(), 1);  // integer keys are not bytes
+    KovTestAccess::key(ci, buf.data(), 1);  // integer keys are not bytes
     EXPECT_EQ(buf, "........");
-    EXPECT_EQ(ci.TEST_keySize(), 5);
+    EXPECT_EQ(KovTestAccess::keySize(ci), 5);
 }
 
 TEST_F(StoreTest, EmptyKeyIsAnOrdinaryKey) {
@@ -465,7 +465,7 @@ TEST_F(StoreTest, EmptyKeyIsAnOrdinaryKey) {
     insertBytes(c, "", "empty");
     insertBytes(c, "a", "a");
     EXPECT_EQ(seekBytes(c, ""), 0);
-    EXPECT_EQ(c.TEST_keySize(), 0);
+    EXPECT_EQ(KovTestAccess::keySize(c), 0);
     EXPECT_EQ(dataOf(c), "empty");
     ASSERT_TRUE(c.next());
     EXPECT_EQ(byteKey(c), "a");
@@ -559,12 +559,12 @@ TEST_F(IndexKeys, PrivateFetchNeedsTheExactLength) {
     fill(c);
     ASSERT_TRUE(c.indexKeySeek("ab22", 4));
     char buf[4] = {'.', '.', '.', '.'};
-    EXPECT_FALSE(c.TEST_indexKeyFetch("ab", 2, buf, 1));
-    EXPECT_FALSE(c.TEST_indexKeyFetch("ab", 2, buf, 3));
+    EXPECT_FALSE(KovTestAccess::indexKeyFetch(c, "ab", 2, buf, 1));
+    EXPECT_FALSE(KovTestAccess::indexKeyFetch(c, "ab", 2, buf, 3));
     EXPECT_EQ(std::string(buf, 4), "....");
-    EXPECT_FALSE(c.TEST_indexKeyFetch("ax", 2, buf, 2));
+    EXPECT_FALSE(KovTestAccess::indexKeyFetch(c, "ax", 2, buf, 2));
     EXPECT_EQ(std::string(buf, 4), "....");
-    EXPECT_TRUE(c.TEST_indexKeyFetch("ab", 2, buf, 2));
+    EXPECT_TRUE(KovTestAccess::indexKeyFetch(c, "ab", 2, buf, 2));
     EXPECT_EQ(std::string(buf, 4), "22..");
 }
 
