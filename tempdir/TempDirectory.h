@@ -21,9 +21,11 @@
 //
 // Environment values, and what becomes of them:
 //   - unset or empty: skipped; the search goes on to the next candidate.
-//   - only separators ("/", "///"; on Windows also backslashes): treated as unset and skipped. Such
-//     a value names the root of the file system (or of the current drive), which would publish as
-//     an empty text; the root is no place for a store's temporary file.
+//   - only separators: on POSIX ("/", "///") treated as unset and skipped: the value names the
+//     root of the file system, no place for a store's temporary file, and it would publish as an
+//     empty text. On Windows ("\\", "/", "/\\/") it names the root of the current drive, which
+//     exists: it is chosen and published as an empty text, which the engine then reads as "use
+//     your own default directory".
 //   - very long (say 10 000 characters): tested like any other value; a path longer than the
 //     platform accepts is reported missing by the file system and skipped.
 //   - bytes that are not valid UTF-8 (or not valid in the ANSI code page): never converted or

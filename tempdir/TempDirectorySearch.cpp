@@ -55,7 +55,7 @@ TempDirectorySearchResult searchTempDirectory(
                 // The source is set first; it is also the name looked up.
                 result.source = candidate.text;
                 std::string value = getEnvironmentVariable(result.source);
-                if (onlySeparators(value)) {
+                if (separatorOnlyValuesAreSkipped() && onlySeparators(value)) {
                     value.clear();
                 }
                 dir = directoryOf(value);

@@ -6,8 +6,9 @@
 // path, which never exists) and a `source` text:
 //   1. For each candidate in order:
 //      - a variable candidate sets `source` to the variable's name, reads the variable
-//        (getEnvironmentVariable), and `dir` becomes the directory of its value; a value made only
-//        of separators (tempDirectorySeparators()) is taken as unset, that is as the empty path;
+//        (getEnvironmentVariable), and `dir` becomes the directory of its value; where the
+//        platform says so (separatorOnlyValuesAreSkipped()), a value made only of separators
+//        (tempDirectorySeparators()) is taken as unset, that is as the empty path;
 //      - a fixed candidate clears `source`, and `dir` becomes the directory of its path;
 //      - a located candidate clears `source` and runs its locator; only when the locator finds a
 //        path does `dir` become the directory of that path, otherwise `dir` keeps the previous
@@ -72,6 +73,11 @@ std::vector<TempDirectoryCandidate> tempDirectoryCandidates();
 // The characters stripped from the end of a published directory: "/" on POSIX, where a backslash
 // is an ordinary file-name character; "/" and "\\" on Windows (defined in the platform file).
 const std::string& tempDirectorySeparators();
+
+// Whether an environment value made only of separators is taken as unset: true on POSIX, where it
+// names the file system's root; false on Windows, where the root of the current drive is a
+// candidate like any other (defined in the platform file).
+bool separatorOnlyValuesAreSkipped();
 
 }  // namespace kov
 

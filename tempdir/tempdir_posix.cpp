@@ -16,6 +16,10 @@ std::vector<TempDirectoryCandidate> tempDirectoryCandidates() {
     };
 }
 
+bool separatorOnlyValuesAreSkipped() {
+    return true;
+}
+
 const std::string& tempDirectorySeparators() {
     static const std::string separators("/");
     return separators;

@@ -39,6 +39,10 @@ std::vector<TempDirectoryCandidate> tempDirectoryCandidates() {
     };
 }
 
+bool separatorOnlyValuesAreSkipped() {
+    return false;
+}
+
 const std::string& tempDirectorySeparators() {
     static const std::string separators("/\\");
     return separators;

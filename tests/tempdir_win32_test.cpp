@@ -222,13 +222,14 @@ TEST_F(TempDirWin32Test, ASingleDotIsPublishedAsADot) {
     EXPECT_EQ(source(), "KOV_TEMP");
 }
 
-TEST_F(TempDirWin32Test, OnlySeparatorsValueIsSkipped) {
+// The root of the current drive exists: it is chosen, and its native path, made only of
+// separators, publishes as an empty text.
+TEST_F(TempDirWin32Test, OnlySeparatorsValueNamesTheDriveRootAndPublishesEmpty) {
     const std::string tmp = makeDirectory("tmp");
-    setVariable("KOV_TEMP", "\\");
-    setVariable("TEMP", "/\\/");
+    setVariable("KOV_TEMP", "/");
     setVariable("TMP", tmp);
-    EXPECT_EQ(kov::getTempDirectory(), tmp);
-    EXPECT_EQ(source(), "TMP");
+    EXPECT_EQ(kov::getTempDirectory(), "");
+    EXPECT_EQ(source(), "KOV_TEMP");
 }
 
 TEST_F(TempDirWin32Test, LocalAppDataTempWinsWhenNoVariableIsUsable) {
