@@ -171,15 +171,26 @@ bool KovBtreeCursor::indexKeyFetch(const void* prefix, std::uint64_t prefixSize,
     return fetchPayload(prefix, prefixSize, payload.data(), payload.size());
 }
 
-// The current key is prefixSize + payloadSize bytes long. Its first prefixSize bytes are read
-// into a zero-filled scratch buffer of this operation's own (on the stack for the short
-// prefixes composite keys use) and compared; only on a match is the rest of the key read, straight
-// into the caller's payload buffer, which a mismatch leaves untouched.
+// The current key is prefixSize + payloadSize bytes long. It is read into a zero-filled scratch
+// buffer of this operation's own, on the stack for the short keys composite indexes use, and its
+// prefix compared; on a match the payload is copied out. A long key is read in two parts instead:
+// the prefix into the scratch buffer and, only on a match, the payload straight into the caller's
+// buffer. Either way a mismatch leaves the payload buffer untouched.
 bool KovBtreeCursor::fetchPayload(const void* prefix, std::uint64_t prefixSize, void* payload,
                                   std::uint64_t payloadSize) {
     eng::BtCursor* cursor = handle();
+    const std::uint64_t keyLength = prefixSize + payloadSize;
+    unsigned char local[64];
+    if (keyLength <= sizeof local) {
+        std::memset(local, 0, static_cast<std::size_t>(keyLength));
+        eng::sqlite3BtreeKey(cursor, 0, static_cast<std::uint32_t>(keyLength), local);
+        if (prefixSize > 0 && std::memcmp(local, prefix, static_cast<std::size_t>(prefixSize)) != 0)
+            return false;
+        if (payloadSize > 0)
+            std::memcpy(payload, local + prefixSize, static_cast<std::size_t>(payloadSize));
+        return true;
+    }
     if (prefixSize > 0) {
-        unsigned char local[64];
         std::unique_ptr<unsigned char[]> large;
         unsigned char* scratch = local;
         if (prefixSize > sizeof local) {
@@ -191,10 +202,8 @@ bool KovBtreeCursor::fetchPayload(const void* prefix, std::uint64_t prefixSize, 
         if (std::memcmp(scratch, prefix, static_cast<std::size_t>(prefixSize)) != 0)
             return false;
     }
-    if (payloadSize > 0) {
-        eng::sqlite3BtreeKey(cursor, static_cast<std::uint32_t>(prefixSize),
-                             static_cast<std::uint32_t>(payloadSize), payload);
-    }
+    eng::sqlite3BtreeKey(cursor, static_cast<std::uint32_t>(prefixSize),
+                         static_cast<std::uint32_t>(payloadSize), payload);
     return true;
 }
 
