@@ -101,8 +101,7 @@ struct Btree {
     sqlite3* db = nullptr;
     std::unordered_map<std::uint32_t, std::unique_ptr<Table>> tables;
     int openCursors = 0;
-    Transaction transaction = Transaction::None;  // what the connection holds
-    Transaction wanted = Transaction::None;       // what the owner began
+    Transaction transaction = Transaction::None;
     bool pageSizeFixed = false;
     std::uint64_t nextTableId = 1;
     sqlite3_stmt* rootOf = nullptr;  // SELECT rootpage ... WHERE name = ?1
@@ -136,19 +135,6 @@ void noteFailure(Btree* bt) {
     if (bt->db != nullptr && sqlite3_get_autocommit(bt->db) != 0) {
         bt->transaction = Transaction::None;
     }
-}
-
-// Writes need the write transaction the owner began. When SQLite ended it
-// after an I/O error (with no journal its rollback undoes nothing, so what
-// the cache holds is still there), it is begun again here, so one transient
-// fault does not stop every later write. Without a write transaction of the
-// owner's, writes are refused with SQLITE_ERROR.
-int needWriteTransaction(Btree* bt) {
-    if (bt->wanted != Transaction::Write) return SQLITE_ERROR;
-    if (bt->transaction == Transaction::Write) return SQLITE_OK;
-    int rc = exec(bt->db, "BEGIN EXCLUSIVE");
-    if (rc == SQLITE_OK) bt->transaction = Transaction::Write;
-    return rc;
 }
 
 std::string selectSql(const Table& t, int kind) {
@@ -422,7 +408,7 @@ int sqlite3BtreeBeginTrans(Btree* p, int wrflag) {
     if (wrflag == 0) {
         if (p->transaction == Transaction::Read) return SQLITE_OK;
         int rc = exec(p->db, "BEGIN DEFERRED");
-        if (rc == SQLITE_OK) p->transaction = p->wanted = Transaction::Read;
+        if (rc == SQLITE_OK) p->transaction = Transaction::Read;
         return rc;
     }
     if (p->transaction == Transaction::Read) {
@@ -433,7 +419,7 @@ int sqlite3BtreeBeginTrans(Btree* p, int wrflag) {
     }
     int rc = exec(p->db, wrflag > 1 ? "BEGIN EXCLUSIVE" : "BEGIN IMMEDIATE");
     if (rc == SQLITE_OK) {
-        p->transaction = p->wanted = Transaction::Write;
+        p->transaction = Transaction::Write;
         p->pageSizeFixed = true;
     }
     return rc;
@@ -442,7 +428,7 @@ int sqlite3BtreeBeginTrans(Btree* p, int wrflag) {
 int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags) {
     if (p == nullptr || piTable == nullptr) return SQLITE_MISUSE;
     if (p->openCursors > 0) return SQLITE_LOCKED;
-    if (int rc = needWriteTransaction(p); rc != SQLITE_OK) return rc;
+    if (p->transaction != Transaction::Write) return SQLITE_ERROR;
 
     auto t = std::make_unique<Table>();
     t->intKey = (flags & BTREE_INTKEY) != 0;
@@ -480,9 +466,9 @@ int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags) {
 int sqlite3BtreeDropTable(Btree* p, std::uint32_t iTable, int* piMoved) {
     if (p == nullptr || piMoved == nullptr) return SQLITE_MISUSE;
     if (p->openCursors > 0) return SQLITE_LOCKED;
+    if (p->transaction != Transaction::Write) return SQLITE_ERROR;
     auto found = p->tables.find(iTable);
     if (found == p->tables.end()) return SQLITE_ERROR;
-    if (int rc = needWriteTransaction(p); rc != SQLITE_OK) return rc;
 
     Table* t = found->second.get();
     // The table's statements would hold its schema entry; finalize them first.
@@ -646,7 +632,7 @@ int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, cons
     if (pCur == nullptr || pCur->bt == nullptr) return SQLITE_MISUSE;
     Btree* bt = pCur->bt;
     Table* t = pCur->table;
-    if (bt->wanted != Transaction::Write) return SQLITE_ERROR;
+    if (bt->transaction != Transaction::Write) return SQLITE_ERROR;
     if (!pCur->write) return SQLITE_PERM;
     if (t->readCursors > 0) return SQLITE_LOCKED;
     if (!t->intKey) {
@@ -655,7 +641,6 @@ int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, cons
     }
     if (nData < 0) return SQLITE_ERROR;
     if (pData == nullptr && nData > 0) return SQLITE_MISUSE;
-    if (int rc = needWriteTransaction(bt); rc != SQLITE_OK) return rc;
 
     if (t->insert == nullptr) {
         std::string sql;

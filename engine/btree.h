@@ -58,8 +58,10 @@
 // Refusals leave every state as it was. Failures reported by SQLite itself
 // (I/O errors, a full disk, out of memory) are returned as its result code;
 // a cursor whose step failed is left on no entry. When such a failure made
-// SQLite end the write transaction, the next insert, table creation or drop
-// begins it again, so a transient fault does not stop later writes.
+// SQLite end the write transaction, every later insert, table creation and
+// drop is refused with SQLITE_ERROR until the engine is closed: with no
+// journal SQLite's rollback undoes nothing, and writes on top of what it
+// left could silently damage entries that still read back whole.
 // docs/faults.md says what stays readable after each kind of fault.
 #ifndef KOVPAGER_ENGINE_BTREE_H
 #define KOVPAGER_ENGINE_BTREE_H
