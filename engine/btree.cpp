@@ -612,6 +612,18 @@ int sqlite3BtreeKey(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, voi
     return SQLITE_OK;
 }
 
+const void* sqlite3BtreeKeyFetch(BtCursor* pCur, std::uint32_t* pAmt) {
+    if (pCur == nullptr || pAmt == nullptr) return nullptr;
+    if (pCur->row == nullptr || pCur->table->intKey || pCur->keyLen > UINT32_MAX) {
+        *pAmt = 0;
+        return nullptr;
+    }
+    *pAmt = static_cast<std::uint32_t>(pCur->keyLen);
+    // SQLite hands out no pointer for an empty blob; the key is then empty.
+    static const unsigned char kEmpty = 0;
+    return pCur->key != nullptr ? pCur->key : &kEmpty;
+}
+
 int sqlite3BtreeDataSize(BtCursor* pCur, std::uint32_t* pSize) {
     if (pCur == nullptr || pSize == nullptr) return SQLITE_MISUSE;
     *pSize = static_cast<std::uint32_t>(pCur->dataLen);

@@ -178,6 +178,12 @@ int sqlite3BtreeKeySize(BtCursor* pCur, std::int64_t* pSize);
 // Copies amt bytes of key-then-data, from offset, into pBuf.
 int sqlite3BtreeKey(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, void* pBuf);
 
+// The current entry's key bytes in place, without a copy: a pointer valid
+// until the cursor moves or its table changes, with *pAmt set to the key's
+// length. Null (and *pAmt 0) on no entry and on an integer-keyed table;
+// null with *pAmt untouched for a null handle.
+const void* sqlite3BtreeKeyFetch(BtCursor* pCur, std::uint32_t* pAmt);
+
 // The data's length in bytes; 0 on no entry.
 int sqlite3BtreeDataSize(BtCursor* pCur, std::uint32_t* pSize);
 

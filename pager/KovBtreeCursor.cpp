@@ -7,7 +7,6 @@
 #include <kovpager/KovBtreeCursor.h>
 
 #include <cstring>
-#include <memory>
 
 #include "engine/btree.h"
 
@@ -171,39 +170,21 @@ bool KovBtreeCursor::indexKeyFetch(const void* prefix, std::uint64_t prefixSize,
     return fetchPayload(prefix, prefixSize, payload.data(), payload.size());
 }
 
-// The current key is prefixSize + payloadSize bytes long. It is read into a zero-filled scratch
-// buffer of this operation's own, on the stack for the short keys composite indexes use, and its
-// prefix compared; on a match the payload is copied out. A long key is read in two parts instead:
-// the prefix into the scratch buffer and, only on a match, the payload straight into the caller's
-// buffer. Either way a mismatch leaves the payload buffer untouched.
+// The current key is known to be prefixSize + payloadSize bytes long. The engine lends it in
+// place: the prefix is compared there and, on a match, the payload copied out of it, so no key is
+// copied that the caller did not ask for. A mismatch leaves the payload buffer untouched. With no
+// entry (or no engine cursor) the key reads as empty.
 bool KovBtreeCursor::fetchPayload(const void* prefix, std::uint64_t prefixSize, void* payload,
                                   std::uint64_t payloadSize) {
-    eng::BtCursor* cursor = handle();
-    const std::uint64_t keyLength = prefixSize + payloadSize;
-    unsigned char local[64];
-    if (keyLength <= sizeof local) {
-        std::memset(local, 0, static_cast<std::size_t>(keyLength));
-        eng::sqlite3BtreeKey(cursor, 0, static_cast<std::uint32_t>(keyLength), local);
-        if (prefixSize > 0 && std::memcmp(local, prefix, static_cast<std::size_t>(prefixSize)) != 0)
-            return false;
-        if (payloadSize > 0)
-            std::memcpy(payload, local + prefixSize, static_cast<std::size_t>(payloadSize));
-        return true;
-    }
-    if (prefixSize > 0) {
-        std::unique_ptr<unsigned char[]> large;
-        unsigned char* scratch = local;
-        if (prefixSize > sizeof local) {
-            large.reset(new unsigned char[static_cast<std::size_t>(prefixSize)]);
-            scratch = large.get();
-        }
-        std::memset(scratch, 0, static_cast<std::size_t>(prefixSize));
-        eng::sqlite3BtreeKey(cursor, 0, static_cast<std::uint32_t>(prefixSize), scratch);
-        if (std::memcmp(scratch, prefix, static_cast<std::size_t>(prefixSize)) != 0)
-            return false;
-    }
-    eng::sqlite3BtreeKey(cursor, static_cast<std::uint32_t>(prefixSize),
-                         static_cast<std::uint32_t>(payloadSize), payload);
+    std::uint32_t available = 0;
+    const auto* key =
+        static_cast<const unsigned char*>(eng::sqlite3BtreeKeyFetch(handle(), &available));
+    if (available != prefixSize + payloadSize)
+        return false;
+    if (prefixSize > 0 && std::memcmp(key, prefix, static_cast<std::size_t>(prefixSize)) != 0)
+        return false;
+    if (payloadSize > 0)
+        std::memcpy(payload, key + prefixSize, static_cast<std::size_t>(payloadSize));
     return true;
 }
 
