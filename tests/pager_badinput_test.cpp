@@ -6,6 +6,7 @@
 
 #include <cstdint>
 #include <cstdio>
+#include <cstdlib>
 #include <cstring>
 #include <fstream>
 #include <memory>
@@ -327,7 +328,9 @@ TEST_F(StoreTest, PagerCopiedAndAssignedBackWhileNothingChanged) {
 }
 
 // 1 000 cursors, opened ten at a time around 100 table creations: every creation closes and
-// reopens all of them, and each comes back on its entry.
+// reopens all of them, and each comes back on its entry. They are made as read cursors (a
+// writing cursor made while a read cursor is open on the table would be refused); each table
+// creation brings them back as writing cursors.
 TEST_F(StoreTest, AThousandCursorsAcrossAHundredTableCreations) {
     std::vector<std::unique_ptr<KovBtree>> tables;
     std::vector<std::unique_ptr<KovBtreeCursor>> cursors;
@@ -341,7 +344,7 @@ TEST_F(StoreTest, AThousandCursorsAcrossAHundredTableCreations) {
     for (int round = 0; round < 100; ++round) {
         for (int i = 0; i < 10; ++i) {
             const std::int64_t k = static_cast<std::int64_t>(cursors.size()) * 3;
-            cursors.push_back(std::make_unique<KovBtreeCursor>(*tables[0], (i % 2) == 0));
+            cursors.push_back(std::make_unique<KovBtreeCursor>(*tables[0], false));
             ASSERT_EQ(cursors.back()->seek(k), 0);
             keys.push_back(k);
         }
@@ -372,10 +375,14 @@ TEST_F(StoreTest, AHundredThousandTablesMadeAndDestroyed) {
         KovBtree t(static_cast<KovBtree::TableType>(i % 3));
     const long rssAfter = peakRssKiB();
     const std::int64_t pagesAfter = enginePages();
-    std::printf("peak RSS %ld -> %ld KiB, database %lld -> %lld pages after %d tables\n",
-                rssBefore, rssAfter, static_cast<long long>(pagesBefore),
-                static_cast<long long>(pagesAfter), count);
-    EXPECT_LT(rssAfter - rssBefore, 16 * 1024);
+    std::printf("peak RSS %ld -> %ld KiB, database %lld -> %lld pages after %d tables\n", rssBefore,
+                rssAfter, static_cast<long long>(pagesBefore), static_cast<long long>(pagesAfter),
+                count);
+    // AddressSanitizer holds freed memory in quarantine (up to 256 MiB): there the resident set
+    // says nothing about growth, and its leak check does the job.
+    if (!sanitized()) {
+        EXPECT_LT(rssAfter - rssBefore, 16 * 1024);
+    }
     EXPECT_LE(pagesAfter, pagesBefore + 8);
     KovBtree last(KovBtree::BlobTable);
     KovBtreeCursor c(last, true);

@@ -1,0 +1,331 @@
+// The fault-injecting VFS: a thin layer of callbacks that count, decide and
+// forward to the wrapped VFS.
+//
+// A file opened through it is a FaultFile followed, at an 8-byte aligned
+// offset, by the wrapped VFS's own file object. The FaultFile's methods are
+// version 1 (no shared memory, no memory mapping), so every page read and
+// write of the database goes through xRead and xWrite and is counted.
+#include "fault_vfs.h"
+
+#include <cstddef>
+#include <cstring>
+
+namespace kov::test {
+
+namespace {
+
+struct FaultFile {
+    sqlite3_file base;
+    FaultVfs* owner;
+    std::uint64_t size;  // the end of the furthest write, for the space budget
+    bool deleteOnClose;
+};
+
+constexpr std::size_t kRealOffset = (sizeof(FaultFile) + 7) / 8 * 8;
+
+sqlite3_file* realFile(sqlite3_file* f) {
+    return reinterpret_cast<sqlite3_file*>(reinterpret_cast<unsigned char*>(f) + kRealOffset);
+}
+
+FaultFile* faultFile(sqlite3_file* f) {
+    return reinterpret_cast<FaultFile*>(f);
+}
+
+bool isTemporaryOpen(const char* name, int flags) {
+    return name == nullptr || (flags & (SQLITE_OPEN_DELETEONCLOSE | SQLITE_OPEN_TEMP_DB |
+                                        SQLITE_OPEN_TEMP_JOURNAL | SQLITE_OPEN_TRANSIENT_DB)) != 0;
+}
+
+}  // namespace
+
+struct FaultVfs::Hooks {
+    static FaultVfs* of(sqlite3_vfs* v) { return static_cast<FaultVfs*>(v->pAppData); }
+
+    // File methods.
+    static int close(sqlite3_file* f) {
+        FaultFile* ff = faultFile(f);
+        sqlite3_file* real = realFile(f);
+        int rc = real->pMethods != nullptr ? real->pMethods->xClose(real) : SQLITE_OK;
+        if (ff->deleteOnClose)
+            ff->owner->bytesInUse_ -= ff->size;
+        ff->size = 0;
+        return rc;
+    }
+    static int read(sqlite3_file* f, void* buf, int amt, sqlite3_int64 offset) {
+        FaultFile* ff = faultFile(f);
+        if (ff->owner->take(FaultKind::Read))
+            return SQLITE_IOERR_READ;
+        sqlite3_file* real = realFile(f);
+        return real->pMethods->xRead(real, buf, amt, offset);
+    }
+    static int write(sqlite3_file* f, const void* buf, int amt, sqlite3_int64 offset) {
+        FaultFile* ff = faultFile(f);
+        FaultVfs* owner = ff->owner;
+        if (owner->take(FaultKind::Write))
+            return SQLITE_IOERR_WRITE;
+        std::uint64_t end = static_cast<std::uint64_t>(offset) + static_cast<std::uint64_t>(amt);
+        std::uint64_t growth = end > ff->size ? end - ff->size : 0;
+        if (owner->budgetSet_ && growth > 0 && owner->bytesInUse_ + growth > owner->budget_) {
+            ++owner->fullRefusals_;
+            return SQLITE_FULL;
+        }
+        sqlite3_file* real = realFile(f);
+        int rc = real->pMethods->xWrite(real, buf, amt, offset);
+        if (rc == SQLITE_OK) {
+            ff->size += growth;
+            owner->bytesInUse_ += growth;
+            owner->bytesWritten_ += static_cast<std::uint64_t>(amt);
+        }
+        return rc;
+    }
+    static int truncate(sqlite3_file* f, sqlite3_int64 size) {
+        FaultFile* ff = faultFile(f);
+        if (ff->owner->take(FaultKind::Truncate))
+            return SQLITE_IOERR_TRUNCATE;
+        sqlite3_file* real = realFile(f);
+        int rc = real->pMethods->xTruncate(real, size);
+        std::uint64_t newSize = static_cast<std::uint64_t>(size);
+        if (rc == SQLITE_OK && newSize < ff->size) {
+            ff->owner->bytesInUse_ -= ff->size - newSize;
+            ff->size = newSize;
+        }
+        return rc;
+    }
+    static int sync(sqlite3_file* f, int flags) {
+        FaultFile* ff = faultFile(f);
+        if (ff->owner->take(FaultKind::Sync))
+            return SQLITE_IOERR_FSYNC;
+        sqlite3_file* real = realFile(f);
+        return real->pMethods->xSync(real, flags);
+    }
+    static int fileSize(sqlite3_file* f, sqlite3_int64* pSize) {
+        sqlite3_file* real = realFile(f);
+        return real->pMethods->xFileSize(real, pSize);
+    }
+    static int lock(sqlite3_file* f, int level) {
+        sqlite3_file* real = realFile(f);
+        return real->pMethods->xLock(real, level);
+    }
+    static int unlock(sqlite3_file* f, int level) {
+        sqlite3_file* real = realFile(f);
+        return real->pMethods->xUnlock(real, level);
+    }
+    static int checkReservedLock(sqlite3_file* f, int* pResOut) {
+        sqlite3_file* real = realFile(f);
+        return real->pMethods->xCheckReservedLock(real, pResOut);
+    }
+    static int fileControl(sqlite3_file* f, int op, void* pArg) {
+        sqlite3_file* real = realFile(f);
+        return real->pMethods->xFileControl(real, op, pArg);
+    }
+    static int sectorSize(sqlite3_file* f) {
+        sqlite3_file* real = realFile(f);
+        return real->pMethods->xSectorSize(real);
+    }
+    static int deviceCharacteristics(sqlite3_file* f) {
+        sqlite3_file* real = realFile(f);
+        return real->pMethods->xDeviceCharacteristics(real);
+    }
+
+    static const sqlite3_io_methods methods;
+
+    // VFS methods.
+    static int open(sqlite3_vfs* v, const char* name, sqlite3_file* f, int flags, int* outFlags) {
+        FaultVfs* self = of(v);
+        FaultFile* ff = faultFile(f);
+        std::memset(ff, 0, sizeof(FaultFile));
+        bool temporary = isTemporaryOpen(name, flags);
+        bool fail = self->take(FaultKind::Open);
+        if (temporary && self->take(FaultKind::TempOpen))
+            fail = true;
+        if (fail)
+            return SQLITE_CANTOPEN;
+
+        sqlite3_file* real = realFile(f);
+        std::memset(real, 0, static_cast<std::size_t>(self->real_->szOsFile));
+        int rc = self->real_->xOpen(self->real_, name, real, flags, outFlags);
+        // The wrapped file must be closed whenever it set its methods, even
+        // after a failed open, so the wrapper takes the file over then too.
+        if (real->pMethods != nullptr) {
+            ff->base.pMethods = &methods;
+            ff->owner = self;
+            ff->deleteOnClose = (flags & SQLITE_OPEN_DELETEONCLOSE) != 0 || name == nullptr;
+            sqlite3_int64 size = 0;
+            if (rc == SQLITE_OK && real->pMethods->xFileSize(real, &size) == SQLITE_OK &&
+                size > 0) {
+                ff->size = static_cast<std::uint64_t>(size);
+                if (ff->deleteOnClose)
+                    self->bytesInUse_ += ff->size;
+            }
+            // Bytes of a file that outlives its close are not tracked.
+            if (!ff->deleteOnClose)
+                ff->size = 0;
+        }
+        return rc;
+    }
+    static int remove(sqlite3_vfs* v, const char* name, int syncDir) {
+        sqlite3_vfs* real = of(v)->real_;
+        return real->xDelete(real, name, syncDir);
+    }
+    static int access(sqlite3_vfs* v, const char* name, int flags, int* pResOut) {
+        sqlite3_vfs* real = of(v)->real_;
+        return real->xAccess(real, name, flags, pResOut);
+    }
+    static int fullPathname(sqlite3_vfs* v, const char* name, int nOut, char* zOut) {
+        sqlite3_vfs* real = of(v)->real_;
+        return real->xFullPathname(real, name, nOut, zOut);
+    }
+    static void* dlOpen(sqlite3_vfs* v, const char* name) {
+        sqlite3_vfs* real = of(v)->real_;
+        return real->xDlOpen(real, name);
+    }
+    static void dlError(sqlite3_vfs* v, int nByte, char* zErrMsg) {
+        sqlite3_vfs* real = of(v)->real_;
+        real->xDlError(real, nByte, zErrMsg);
+    }
+    static void (*dlSym(sqlite3_vfs* v, void* handle, const char* symbol))(void) {
+        sqlite3_vfs* real = of(v)->real_;
+        return real->xDlSym(real, handle, symbol);
+    }
+    static void dlClose(sqlite3_vfs* v, void* handle) {
+        sqlite3_vfs* real = of(v)->real_;
+        real->xDlClose(real, handle);
+    }
+    static int randomness(sqlite3_vfs* v, int nByte, char* zOut) {
+        sqlite3_vfs* real = of(v)->real_;
+        return real->xRandomness(real, nByte, zOut);
+    }
+    static int sleep(sqlite3_vfs* v, int microseconds) {
+        sqlite3_vfs* real = of(v)->real_;
+        return real->xSleep(real, microseconds);
+    }
+    static int currentTime(sqlite3_vfs* v, double* pOut) {
+        sqlite3_vfs* real = of(v)->real_;
+        return real->xCurrentTime(real, pOut);
+    }
+    static int getLastError(sqlite3_vfs* v, int n, char* zOut) {
+        sqlite3_vfs* real = of(v)->real_;
+        return real->xGetLastError != nullptr ? real->xGetLastError(real, n, zOut) : 0;
+    }
+    static int currentTimeInt64(sqlite3_vfs* v, sqlite3_int64* pOut) {
+        sqlite3_vfs* real = of(v)->real_;
+        if (real->iVersion >= 2 && real->xCurrentTimeInt64 != nullptr)
+            return real->xCurrentTimeInt64(real, pOut);
+        double now = 0;
+        int rc = real->xCurrentTime(real, &now);
+        *pOut = static_cast<sqlite3_int64>(now * 86400000.0);
+        return rc;
+    }
+};
+
+const sqlite3_io_methods FaultVfs::Hooks::methods = {
+    1,
+    &FaultVfs::Hooks::close,
+    &FaultVfs::Hooks::read,
+    &FaultVfs::Hooks::write,
+    &FaultVfs::Hooks::truncate,
+    &FaultVfs::Hooks::sync,
+    &FaultVfs::Hooks::fileSize,
+    &FaultVfs::Hooks::lock,
+    &FaultVfs::Hooks::unlock,
+    &FaultVfs::Hooks::checkReservedLock,
+    &FaultVfs::Hooks::fileControl,
+    &FaultVfs::Hooks::sectorSize,
+    &FaultVfs::Hooks::deviceCharacteristics,
+    nullptr,
+    nullptr,
+    nullptr,
+    nullptr,
+    nullptr,
+    nullptr,
+};
+
+FaultVfs::FaultVfs() : real_(sqlite3_vfs_find(nullptr)) {
+    vfs_.iVersion = 2;
+    vfs_.szOsFile = static_cast<int>(kRealOffset) + (real_ != nullptr ? real_->szOsFile : 0);
+    vfs_.mxPathname = real_ != nullptr ? real_->mxPathname : 512;
+    vfs_.zName = "kov-fault";
+    vfs_.pAppData = this;
+    vfs_.xOpen = &Hooks::open;
+    vfs_.xDelete = &Hooks::remove;
+    vfs_.xAccess = &Hooks::access;
+    vfs_.xFullPathname = &Hooks::fullPathname;
+    vfs_.xDlOpen = &Hooks::dlOpen;
+    vfs_.xDlError = &Hooks::dlError;
+    vfs_.xDlSym = &Hooks::dlSym;
+    vfs_.xDlClose = &Hooks::dlClose;
+    vfs_.xRandomness = &Hooks::randomness;
+    vfs_.xSleep = &Hooks::sleep;
+    vfs_.xCurrentTime = &Hooks::currentTime;
+    vfs_.xGetLastError = &Hooks::getLastError;
+    vfs_.xCurrentTimeInt64 = &Hooks::currentTimeInt64;
+}
+
+bool FaultVfs::take(FaultKind kind) {
+    KindState& s = state_[index(kind)];
+    ++s.calls;
+    bool fail = s.trigger != 0 && (s.calls == s.trigger || (s.persistent && s.calls > s.trigger));
+    if (fail)
+        ++s.injected;
+    return fail;
+}
+
+void FaultVfs::failAt(FaultKind kind, std::uint64_t n, FaultMode mode) {
+    KindState& s = state_[index(kind)];
+    if (n == 0)
+        n = 1;
+    s.trigger = s.calls + n;
+    s.persistent = mode == FaultMode::Persistent;
+}
+
+void FaultVfs::clear(FaultKind kind) {
+    KindState& s = state_[index(kind)];
+    s.trigger = 0;
+    s.persistent = false;
+}
+
+void FaultVfs::clearAll() {
+    for (int k = 0; k < kFaultKinds; ++k)
+        clear(static_cast<FaultKind>(k));
+}
+
+void FaultVfs::setSpaceBudget(std::uint64_t bytes) {
+    budgetSet_ = true;
+    budget_ = bytes;
+}
+
+void FaultVfs::clearSpaceBudget() {
+    budgetSet_ = false;
+}
+
+void FaultVfs::resetCounters() {
+    for (KindState& s : state_) {
+        // An armed fault keeps its distance from the calls still to come.
+        if (s.trigger > s.calls) {
+            s.trigger -= s.calls;
+        } else if (s.trigger != 0) {
+            // Already reached: a persistent fault goes on failing, a single one is spent.
+            s.trigger = s.persistent ? 1 : 0;
+        }
+        s.calls = 0;
+        s.injected = 0;
+    }
+    fullRefusals_ = 0;
+    bytesWritten_ = 0;
+}
+
+ScopedFaultVfs::ScopedFaultVfs() : previous_(sqlite3_vfs_find(nullptr)) {
+    sqlite3_initialize();
+    if (faults_.wrapped() != nullptr)
+        registerRc_ = sqlite3_vfs_register(faults_.vfs(), 1);
+}
+
+ScopedFaultVfs::~ScopedFaultVfs() {
+    if (registerRc_ != SQLITE_OK)
+        return;
+    sqlite3_vfs_unregister(faults_.vfs());
+    if (previous_ != nullptr)
+        sqlite3_vfs_register(previous_, 1);
+}
+
+}  // namespace kov::test
