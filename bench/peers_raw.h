@@ -1,0 +1,90 @@
+// Hand-written SQLite with the store's settings (bench/raw_sqlite.h: a
+// private temporary database, 4096-byte pages, a 16384-page cache, no
+// journal, the exclusive lock, one transaction never committed, prepared
+// statements, INSERT OR REPLACE).
+#ifndef KOVPAGER_BENCH_PEERS_RAW_H
+#define KOVPAGER_BENCH_PEERS_RAW_H
+
+#include <cstdint>
+#include <cstring>
+#include <memory>
+#include <string>
+#include <vector>
+
+#include "bench/bench_util.h"
+#include "bench/raw_sqlite.h"
+
+namespace kov::peers {
+
+class RawBackend {
+  public:
+    static constexpr const char* kName = "sqlite";
+
+    explicit RawBackend(const std::string& /*scratch: SQLITE_TMPDIR names it*/)
+        : db_(std::make_unique<kov::bench::RawDatabase>()) {}
+    ~RawBackend() {
+        ints_.reset();
+        blobs_.reset();
+        keys_.reset();
+        db_.reset();
+    }
+    RawBackend(const RawBackend&) = delete;
+    RawBackend& operator=(const RawBackend&) = delete;
+
+    void beginInt() { ints_ = std::make_unique<kov::bench::RawIntTable>(*db_); }
+    void beginBlob() { blobs_ = std::make_unique<kov::bench::RawBlobTable>(*db_); }
+    void beginKeys() { keys_ = std::make_unique<kov::bench::RawKeyTable>(*db_); }
+
+    void intInsert(std::int64_t key, const unsigned char* data, std::size_t size) {
+        ints_->insert(key, data, size);
+    }
+    void blobInsert(const unsigned char* key, std::size_t keySize, const unsigned char* data,
+                    std::size_t dataSize) {
+        blobs_->insert(key, keySize, data, dataSize);
+    }
+    void keyInsert(const unsigned char* key, std::size_t keySize) { keys_->insert(key, keySize); }
+
+    void scan(kov::bench::Tally& tally) {
+        for (kov::bench::RawScan& s = blobs_->scan(); s.step();) {
+            std::size_t keySize = s.bytes(0);
+            key_.resize(keySize);
+            std::memcpy(key_.data(), s.blob(0), keySize);
+            std::size_t dataSize = s.bytes(1);
+            data_.resize(dataSize);
+            std::memcpy(data_.data(), s.blob(1), dataSize);
+            tally.add(key_.data(), keySize, data_.data());
+        }
+    }
+
+    bool seek(const unsigned char* key, std::size_t keySize, kov::bench::Tally& tally) {
+        data_.resize(kov::bench::kDataSize);
+        std::int64_t size = blobs_->seekData(key, keySize, data_.data(), data_.size());
+        if (size < 0) {
+            return false;
+        }
+        tally.add(key, keySize, data_.data());
+        return true;
+    }
+
+    std::size_t walk(const unsigned char* prefix, std::size_t prefixSize,
+                     kov::bench::Tally& tally) {
+        return keys_->walkPrefix(prefix, prefixSize,
+                                 [&](const unsigned char* payload, std::size_t size) {
+                                     key_.resize(size);
+                                     std::memcpy(key_.data(), payload, size);
+                                     tally.add(prefix, size, key_.data());
+                                 });
+    }
+
+  private:
+    std::unique_ptr<kov::bench::RawDatabase> db_;
+    std::unique_ptr<kov::bench::RawIntTable> ints_;
+    std::unique_ptr<kov::bench::RawBlobTable> blobs_;
+    std::unique_ptr<kov::bench::RawKeyTable> keys_;
+    std::vector<unsigned char> key_;
+    std::vector<unsigned char> data_;
+};
+
+}  // namespace kov::peers
+
+#endif  // KOVPAGER_BENCH_PEERS_RAW_H

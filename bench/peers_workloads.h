@@ -1,0 +1,130 @@
+// Key material of the peer comparison, computed on the fly so that no
+// backend process carries a copy of the workload in memory (its peak memory
+// is then the backend's own, plus a few pages).
+//
+//   RandomKeys keys(n);        // W3..W5: key i is keys.at(i), 16 random bytes,
+//                              // the same bytes bench_util's randomKeys gives
+//   Shuffle order(n);          // W2: order.at(i) is a permutation of [0, n)
+//   CompositeKeys groups;      // W6: 1 000 group prefixes, a walk order and a
+//                              // generator of (random group prefix, random payload)
+//
+// Every backend sees the same keys in the same order, so the tallies of the
+// read workloads agree across backends (the driver prints them).
+#ifndef KOVPAGER_BENCH_PEERS_WORKLOADS_H
+#define KOVPAGER_BENCH_PEERS_WORKLOADS_H
+
+#include <cstdint>
+#include <cstring>
+#include <utility>
+#include <vector>
+
+#include "bench/bench_util.h"
+
+namespace kov::peers {
+
+using kov::bench::Key16;
+using kov::bench::putBigEndian;
+using kov::bench::Random;
+
+constexpr std::uint64_t kGolden = 0x9E3779B97F4A7C15ULL;
+
+// The SplitMix64 output for a given state: Random's k-th draw (k from 1) is
+// mix(seed + k * kGolden).
+inline std::uint64_t mix(std::uint64_t z) {
+    z = (z ^ (z >> 30)) * 0xBF58476D1CE4E5B9ULL;
+    z = (z ^ (z >> 27)) * 0x94D049BB133111EBULL;
+    return z ^ (z >> 31);
+}
+
+// N random 16-byte keys with random access: key i is the generator's draws
+// 2i+1 and 2i+2, big-endian.
+class RandomKeys {
+  public:
+    static constexpr std::uint64_t kSeed = 0x6b6f76;
+    explicit RandomKeys(std::uint64_t n) : n_(n) {}
+    std::uint64_t size() const { return n_; }
+    Key16 at(std::uint64_t i) const {
+        Key16 k;
+        putBigEndian(k.data(), mix(kSeed + (2 * i + 1) * kGolden));
+        putBigEndian(k.data() + 8, mix(kSeed + (2 * i + 2) * kGolden));
+        return k;
+    }
+
+  private:
+    std::uint64_t n_;
+};
+
+// A pseudo-random permutation of [0, n): a four-round balanced Feistel
+// network on the smallest even power of two that holds n, walking the cycle
+// until the value falls inside [0, n).
+class Shuffle {
+  public:
+    explicit Shuffle(std::uint64_t n) : n_(n) {
+        while ((std::uint64_t{1} << (2 * half_)) < n) {
+            ++half_;
+        }
+        mask_ = (std::uint64_t{1} << half_) - 1;
+    }
+    std::uint64_t at(std::uint64_t i) const {
+        std::uint64_t v = i;
+        do {
+            v = round(v);
+        } while (v >= n_);
+        return v;
+    }
+
+  private:
+    std::uint64_t round(std::uint64_t v) const {
+        std::uint64_t left = v >> half_;
+        std::uint64_t right = v & mask_;
+        for (std::uint64_t r = 0; r < 4; ++r) {
+            std::uint64_t f = mix(right ^ (0x5368756666ULL + r * kGolden)) & mask_;
+            std::uint64_t next = left ^ f;
+            left = right;
+            right = next;
+        }
+        return (left << half_) | right;
+    }
+
+    std::uint64_t n_;
+    unsigned half_ = 1;
+    std::uint64_t mask_ = 1;
+};
+
+// W6: composite keys of 16 bytes, an 8-byte group prefix (one of 1 000)
+// followed by an 8-byte random payload, made in insertion order.
+class CompositeKeys {
+  public:
+    static constexpr std::size_t kGroups = 1000;
+    static constexpr std::size_t kPrefixSize = 8;
+
+    CompositeKeys()
+        : prefixes_(kov::bench::randomKeys(kGroups, 0x67726f7570)), random_(0x7061796c6f6164) {
+        walk_.resize(kGroups);
+        for (std::size_t i = 0; i < kGroups; ++i) {
+            walk_[i] = i;
+        }
+        Random order(0x77616c6b);
+        for (std::size_t i = kGroups - 1; i > 0; --i) {
+            std::swap(walk_[i], walk_[order.below(i + 1)]);
+        }
+    }
+    // The next key of the insertion sequence.
+    Key16 next() {
+        Key16 k;
+        std::memcpy(k.data(), prefixes_[random_.below(kGroups)].data(), kPrefixSize);
+        putBigEndian(k.data() + kPrefixSize, random_.next());
+        return k;
+    }
+    // The prefix of the g-th group in walk order (its first kPrefixSize bytes).
+    const unsigned char* walkPrefix(std::size_t g) const { return prefixes_[walk_[g]].data(); }
+
+  private:
+    std::vector<Key16> prefixes_;
+    std::vector<std::size_t> walk_;
+    Random random_;
+};
+
+}  // namespace kov::peers
+
+#endif  // KOVPAGER_BENCH_PEERS_WORKLOADS_H

@@ -1,0 +1,474 @@
+#!/usr/bin/env python3
+"""Runs the store against its peers and writes bench/RESULTS.md and bench/peers.png.
+
+Every backend x workload x N runs in its own process of peers_benchmark (one
+JSON line each). The store and raw SQLite run `--reps` times, back to back and
+alternately (the order flips every repetition) so their ratio is measured on
+the same machine state; the other backends run `--peer-reps` times. The best
+(lowest) processor time of the repetitions is the figure reported.
+
+    bench/run_peers.py --build build-peers                      # N = 100 000 and 1 000 000
+    bench/run_peers.py --build build-peers --big-n 10000000 \\
+        --big-backends store,sqlite --big-workloads W1,W3,W4      # plus a 10 M subset
+    bench/run_peers.py --build build-peers --render-only        # tables and chart again
+
+Raw results accumulate in <build>/peers-results.jsonl (one line per process;
+--fresh starts it over). Only the standard library is used; the chart needs
+gnuplot (Debian gnuplot-nox) and is skipped with a message when it is missing.
+"""
+
+import argparse
+import datetime
+import json
+import os
+import platform
+import shlex
+import shutil
+import statistics
+import subprocess
+import sys
+
+WORKLOADS = {
+    "W1": "sequential integer-key inserts, 100-byte data (ns/insert)",
+    "W2": "the same integer keys in shuffled order (ns/insert)",
+    "W3": "random 16-byte keys, 100-byte data (ns/insert)",
+    "W4": "full ordered scan of W3, key and data read (ns/row)",
+    "W5": "random point seeks of existing W3 keys, data read (ns/seek)",
+    "W6": "prefix walk of 1 000 groups of composite keys (ns/entry walked)",
+    "W6i": "key-only inserts of the W6 composite keys, random order (ns/insert; the fill phase of W6)",
+}
+ORDER = ["W1", "W2", "W3", "W4", "W5", "W6", "W6i"]
+BACKEND_ORDER = ["store", "sqlite", "map", "lmdb", "rocksdb"]
+SETTINGS = {
+    "store": "KovBtree / KovBtreeCursor; one writing cursor per table; temporary file in KOV_TEMP",
+    "sqlite": "hand-written SQL: temporary database (empty name), page_size 4096, cache_size 16384 "
+              "(64 MiB), journal_mode OFF, locking_mode EXCLUSIVE, synchronous OFF, one BEGIN "
+              "EXCLUSIVE never committed, prepared statements, INSERT OR REPLACE (INSERT OR IGNORE "
+              "on the key-only table)",
+    "map": "std::map / std::set in the heap, 100-byte std::array data: the in-memory ceiling",
+    "lmdb": "64 GiB map (sparse), MDB_NOSYNC | MDB_WRITEMAP | MDB_NOMETASYNC, one write "
+            "transaction for the run (aborted at the end), MDB_INTEGERKEY for integer keys; "
+            "cache = the kernel's page cache",
+    "rocksdb": "64 MiB LRU block cache, default write buffer (64 MiB) and background jobs, WAL "
+               "disabled, no sync; integer keys as 8 big-endian bytes",
+}
+
+
+def run_one(program, backend, workload, n, scratch):
+    cmd = [program, "--backend", backend, "--workload", workload, "--n", str(n)]
+    if scratch:
+        cmd += ["--scratch", scratch]
+    proc = subprocess.run(cmd, capture_output=True, text=True)
+    if proc.returncode != 0:
+        sys.stderr.write(f"FAILED: {' '.join(cmd)}\n{proc.stderr}\n")
+        return None
+    line = proc.stdout.strip().splitlines()[-1]
+    return json.loads(line)
+
+
+def measure(args, program, out_path):
+    available = subprocess.run([program, "--list"], capture_output=True, text=True,
+                               check=True).stdout.split()
+    backends = [b for b in args.backends.split(",") if b in available]
+    missing = [b for b in args.backends.split(",") if b not in available]
+    if missing:
+        print(f"not built, skipped: {', '.join(missing)}")
+    plan = []  # (n, workload, [backends])
+    for n in [int(x) for x in args.n.split(",") if x]:
+        for w in args.workloads.split(","):
+            plan.append((n, w, backends))
+    if args.big_n:
+        big = [b for b in args.big_backends.split(",") if b in available]
+        for n in [int(x) for x in args.big_n.split(",") if x]:
+            for w in args.big_workloads.split(","):
+                plan.append((n, w, big))
+    invocation = datetime.datetime.now().isoformat(timespec="seconds")
+    tree = source_tree()
+    with open(out_path, "a") as out:
+        for n, w, names in plan:
+            paired = [b for b in ("store", "sqlite") if b in names]
+            others = [b for b in names if b not in paired]
+            for rep in range(max(args.reps, args.peer_reps)):
+                order = []
+                if rep < args.reps:
+                    order += paired if rep % 2 == 0 else list(reversed(paired))
+                if rep < args.peer_reps:
+                    order += others
+                for b in order:
+                    r = run_one(program, b, w, n, args.scratch)
+                    if r is None:
+                        continue
+                    r["rep"] = rep
+                    r["invocation"] = invocation
+                    r["tree"] = tree
+                    r["time"] = datetime.datetime.now().isoformat(timespec="seconds")
+                    out.write(json.dumps(r) + "\n")
+                    out.flush()
+                    print(f"{w:3} n={n:<9} {b:8} rep {rep}: {r['ns_cpu']:10.1f} ns/op cpu "
+                          f"{r['ns_wall']:10.1f} wall  rss {r['peak_rss_kib'] / 1024:7.1f} MiB "
+                          f"disk {r['disk_bytes'] / 2**20:8.1f} MiB", flush=True)
+
+
+def source_tree():
+    """HEAD of the source tree when the run starts (read-only git calls): rebuild first."""
+    top = os.path.dirname(os.path.dirname(os.path.abspath(__file__)))
+    try:
+        rev = subprocess.run(["git", "-C", top, "rev-parse", "--short", "HEAD"],
+                             capture_output=True, text=True).stdout.strip()
+        dirty = subprocess.run(["git", "-C", top, "diff", "--quiet", "HEAD", "--", "engine",
+                                "pager", "bench", "CMakeLists.txt"]).returncode != 0
+    except OSError:
+        return "?"
+    return (rev or "?") + ("+changes" if dirty else "")
+
+
+def load(path):
+    rows = []
+    with open(path) as f:
+        for line in f:
+            line = line.strip()
+            if line:
+                rows.append(json.loads(line))
+    # the fill phase of W6 is a workload of its own in the tables: W6i.
+    extra = []
+    for r in rows:
+        if r["workload"] == "W6":
+            e = dict(r)
+            e["workload"] = "W6i"
+            e["ns_cpu"] = r["fill_ns_cpu"]
+            e["ns_wall"] = r["fill_ns_wall"]
+            e["ops"] = r["n"]
+            extra.append(e)
+    return rows + extra
+
+
+def fmt_ns(v):
+    if v is None:
+        return "-"
+    if v >= 100:
+        return f"{v:,.0f}"
+    return f"{v:.1f}"
+
+
+def fmt_n(n):
+    if n >= 1000000 and n % 1000000 == 0:
+        return f"{n // 1000000} M"
+    if n >= 1000 and n % 1000 == 0:
+        return f"{n // 1000} k"
+    return str(n)
+
+
+def machine():
+    model = "?"
+    try:
+        with open("/proc/cpuinfo") as f:
+            for line in f:
+                if line.startswith("model name"):
+                    model = line.split(":", 1)[1].strip()
+                    break
+    except OSError:
+        pass
+    mem = "?"
+    try:
+        with open("/proc/meminfo") as f:
+            for line in f:
+                if line.startswith("MemTotal"):
+                    mem = f"{int(line.split()[1]) / 2**20:.1f} GiB"
+    except OSError:
+        pass
+    versions = []
+    for pkg in ("libsqlite3-0", "liblmdb0", "librocksdb7.8", "g++"):
+        try:
+            v = subprocess.run(["dpkg-query", "-W", "-f=${Version}", pkg], capture_output=True,
+                               text=True).stdout.strip()
+            if v:
+                versions.append(f"{pkg} {v}")
+        except OSError:
+            pass
+    return model, mem, versions
+
+
+def render(args, rows, results_md, chart_png, command):
+    by = {}  # (w, n, backend) -> list of results
+    for r in rows:
+        by.setdefault((r["workload"], r["n"], r["backend"]), []).append(r)
+    best = {k: min(v, key=lambda r: r["ns_cpu"]) for k, v in by.items()}
+    ns = sorted({r["n"] for r in rows})
+    backends = [b for b in BACKEND_ORDER if any(r["backend"] == b for r in rows)]
+    workloads = [w for w in ORDER if any(r["workload"] == w for r in rows)]
+
+    model, mem, versions = machine()
+    L = []
+    L.append("# The store against its peers")
+    L.append("")
+    L.append("Generated by `bench/run_peers.py`; do not edit by hand. Each figure is one process "
+             "running one workload on one backend (`peers_benchmark --backend B --workload W --n "
+             "N`); times are **processor nanoseconds per operation** of the whole process (user "
+             "+ system, all threads: RocksDB's background flushes and compactions are charged to "
+             "it), the best of the repetitions. The machine is shared with other engineers' "
+             "builds, so the ratios measured back to back matter more than the absolute numbers.")
+    L.append("")
+    L.append("## Machine and command")
+    L.append("")
+    L.append(f"- {os.cpu_count()} processors (nproc), {model}, {mem} memory, "
+             f"{platform.system()} {platform.release()}")
+    L.append(f"- {', '.join(versions)}")
+    L.append(f"- written {datetime.datetime.now().isoformat(timespec='minutes')}; commands run: "
+             f"`{command}`")
+    reps = {}
+    for r in rows:
+        reps.setdefault(r["backend"], []).append((r["workload"], r["n"]))
+    counts = {b: f"{len(v) / len(set(v)):.1f}".rstrip("0").rstrip(".") for b, v in reps.items()}
+    trees = sorted({r.get("tree", "?") for r in rows})
+    L.append("- source trees measured: " + ", ".join(f"`{t}`" for t in trees) +
+             (" (see the notes under the tables)" if len(trees) > 1 else ""))
+    L.append("- repetitions per figure (mean): " + ", ".join(f"{b} {counts[b]}" for b in backends) +
+             " (store and raw SQLite alternate, their order flipping every repetition)")
+    L.append("")
+    L.append("## Workloads")
+    L.append("")
+    for w in workloads:
+        L.append(f"- **{w}** {WORKLOADS[w]}")
+    L.append("- W4 and W5 first fill W3's table in the same process (not timed in their figure); "
+             "W5 makes max(N/10, min(N, 100 000)) seeks. Keys are computed on the fly, so no "
+             "process holds a copy of the workload; the key computation (a few ns) is inside "
+             "every timing, for every backend alike.")
+    L.append("")
+    L.append("## Backends and their memory settings")
+    L.append("")
+    for b in backends:
+        L.append(f"- **{b}**: {SETTINGS[b]}")
+    L.append("")
+
+    # Headline: store vs raw SQLite.
+    L.append("## Headline: the store / raw SQLite")
+    L.append("")
+    L.append("Best-of ratio = best store time / best raw time (processor time). Paired = the "
+             "median of the ratios of the runs made back to back. Wall = the same best-of ratio "
+             "on elapsed time.")
+    L.append("")
+    hdr = "| workload | " + " | ".join(f"N={fmt_n(n)} best-of | paired | wall" for n in ns) + " |"
+    L.append(hdr)
+    L.append("|---|" + "---:|---:|---:|" * len(ns))
+    for w in workloads:
+        cells = []
+        for n in ns:
+            s = by.get((w, n, "store"))
+            q = by.get((w, n, "sqlite"))
+            if not s or not q:
+                cells += ["-", "-", "-"]
+                continue
+            bs = best[(w, n, "store")]
+            bq = best[(w, n, "sqlite")]
+            ratio = bs["ns_cpu"] / bq["ns_cpu"]
+            pairs = {}
+            for r in s + q:
+                pairs.setdefault((r.get("invocation", ""), r.get("rep", 0)), {})[r["backend"]] = r
+            paired = [p["store"]["ns_cpu"] / p["sqlite"]["ns_cpu"] for p in pairs.values()
+                      if "store" in p and "sqlite" in p]
+            wall = min(r["ns_wall"] for r in s) / min(r["ns_wall"] for r in q)
+            cells += [f"{ratio:.2f}", f"{statistics.median(paired):.2f}" if paired else "-",
+                      f"{wall:.2f}"]
+        L.append(f"| {w} | " + " | ".join(cells) + " |")
+    L.append("")
+
+    # ns/op per workload / backend / N.
+    L.append("## Processor ns per operation (best of repetitions)")
+    L.append("")
+    L.append("| workload | N | " + " | ".join(backends) + " |")
+    L.append("|---|---:|" + "---:|" * len(backends))
+    for w in workloads:
+        for n in ns:
+            if not any((w, n, b) in best for b in backends):
+                continue
+            cells = [fmt_ns(best[(w, n, b)]["ns_cpu"]) if (w, n, b) in best else "-"
+                     for b in backends]
+            L.append(f"| {w} | {fmt_n(n)} | " + " | ".join(cells) + " |")
+    L.append("")
+    L.append("## Ratio to raw SQLite (processor time, best of repetitions; below 1 is faster)")
+    L.append("")
+    L.append("| workload | N | " + " | ".join(backends) + " |")
+    L.append("|---|---:|" + "---:|" * len(backends))
+    for w in workloads:
+        for n in ns:
+            raw = best.get((w, n, "sqlite"))
+            if raw is None:
+                continue
+            cells = [f"{best[(w, n, b)]['ns_cpu'] / raw['ns_cpu']:.2f}" if (w, n, b) in best
+                     else "-" for b in backends]
+            L.append(f"| {w} | {fmt_n(n)} | " + " | ".join(cells) + " |")
+    L.append("")
+    L.append("## Elapsed ns per operation (best of repetitions)")
+    L.append("")
+    L.append("| workload | N | " + " | ".join(backends) + " |")
+    L.append("|---|---:|" + "---:|" * len(backends))
+    for w in workloads:
+        for n in ns:
+            if not any((w, n, b) in by for b in backends):
+                continue
+            cells = [fmt_ns(min(r["ns_wall"] for r in by[(w, n, b)])) if (w, n, b) in by
+                     else "-" for b in backends]
+            L.append(f"| {w} | {fmt_n(n)} | " + " | ".join(cells) + " |")
+    L.append("")
+
+    # Memory and disk.
+    L.append("## Peak memory (MiB, getrusage ru_maxrss, largest over the workloads run)")
+    L.append("")
+    L.append("Includes the program itself (about 12 MiB before any work). LMDB's figure counts "
+             "the pages of its memory map that the process touched.")
+    L.append("")
+    L.append("| backend | " + " | ".join(f"N={fmt_n(n)}" for n in ns) + " |")
+    L.append("|---|" + "---:|" * len(ns))
+    for b in backends:
+        cells = []
+        for n in ns:
+            rs = [r["peak_rss_kib"] for r in rows if r["backend"] == b and r["n"] == n]
+            cells.append(f"{max(rs) / 1024:.0f}" if rs else "-")
+        L.append(f"| {b} | " + " | ".join(cells) + " |")
+    L.append("")
+    L.append("## Temporary disk in use at the end (MiB of allocated blocks, largest over the "
+             "workloads run)")
+    L.append("")
+    L.append("Files under the backend's scratch directory, plus the unlinked temporary file that "
+             "SQLite keeps open (found through /proc/self/fd). The SQLite file exists only once "
+             "the 64 MiB cache spills.")
+    L.append("")
+    L.append("| backend | " + " | ".join(f"N={fmt_n(n)}" for n in ns) + " |")
+    L.append("|---|" + "---:|" * len(ns))
+    for b in backends:
+        cells = []
+        for n in ns:
+            rs = [r["disk_bytes"] for r in rows if r["backend"] == b and r["n"] == n]
+            cells.append(f"{max(rs) / 2**20:.0f}" if rs else "-")
+        L.append(f"| {b} | " + " | ".join(cells) + " |")
+    L.append("")
+
+    # Cross-check of the read tallies.
+    bad = []
+    for w in ("W4", "W5", "W6"):
+        for n in ns:
+            tallies = {(r["rows"], r["sum"]) for r in rows if r["workload"] == w and r["n"] == n}
+            if len(tallies) > 1:
+                bad.append(f"{w} N={fmt_n(n)}")
+    missing = [r for r in rows if r.get("missing", 0)]
+    L.append("## Checks")
+    L.append("")
+    if bad or missing:
+        L.append(f"- **MISMATCH**: read tallies differ across backends for {', '.join(bad)}; "
+                 f"{len(missing)} runs had seeks that found nothing.")
+    else:
+        L.append("- Every backend read the same rows with the same checksum in W4, W5 and W6, "
+                 "and every seek found its key.")
+    L.append("")
+    if len({r.get("tree", "?") for r in rows}) > 1:
+        L.append("## Notes: which source tree each figure comes from")
+        L.append("")
+        groups = {}
+        for r in rows:
+            if r["workload"] == "W6i":
+                continue
+            groups.setdefault(r.get("tree", "?"), set()).add(
+                (r["n"], r["workload"], r["backend"]))
+        for tree, items in sorted(groups.items()):
+            parts = {}
+            for n, w, b in items:
+                parts.setdefault((n, b), []).append(w)
+            text = "; ".join(f"N={fmt_n(n)} {b}: {','.join(sorted(ws))}"
+                             for (n, b), ws in sorted(parts.items()))
+            L.append(f"- `{tree}`: {text}")
+        L.append("")
+    L.append("![ns/op against N](peers.png)")
+    L.append("")
+    with open(results_md, "w") as f:
+        f.write("\n".join(L))
+    print(f"wrote {results_md}")
+
+    chart(best, ns, backends, workloads, chart_png, args)
+
+
+def chart(best, ns, backends, workloads, chart_png, args):
+    gnuplot = shutil.which("gnuplot")
+    if gnuplot is None:
+        print("gnuplot not found (Debian: gnuplot-nox): no chart")
+        return
+    datadir = os.path.join(args.build, "peers-plot")
+    os.makedirs(datadir, exist_ok=True)
+    script = [
+        "set terminal pngcairo size 1600,900 font ',10'",
+        f"set output '{os.path.abspath(chart_png)}'",
+        "set multiplot layout 2,4 title 'ns per operation (processor time) against N' "
+        "font ',13'",
+        "set logscale xy", "set grid", "set key top left font ',8'",
+        "set xlabel 'N'", "set ylabel 'ns/op'", "set format x '10^{%L}'",
+    ]
+    styles = {"store": "lw 3 lc rgb '#d62728' pt 7", "sqlite": "lw 2 lc rgb '#1f77b4' pt 5",
+              "map": "lw 1 lc rgb '#7f7f7f' pt 9 dt 2", "lmdb": "lw 2 lc rgb '#2ca02c' pt 11",
+              "rocksdb": "lw 2 lc rgb '#9467bd' pt 13"}
+    for w in workloads:
+        plots = []
+        for b in backends:
+            pts = [(n, best[(w, n, b)]["ns_cpu"]) for n in ns if (w, n, b) in best]
+            if not pts:
+                continue
+            path = os.path.join(datadir, f"{w}-{b}.dat")
+            with open(path, "w") as f:
+                for n, v in pts:
+                    f.write(f"{n} {v}\n")
+            plots.append(f"'{path}' using 1:2 with linespoints title '{b}' "
+                         f"{styles.get(b, '')}")
+        if plots:
+            script.append(f"set title '{w}: {WORKLOADS[w].split(' (')[0]}' font ',9'")
+            script.append("plot " + ", ".join(plots))
+    script.append("unset multiplot")
+    path = os.path.join(datadir, "peers.gp")
+    with open(path, "w") as f:
+        f.write("\n".join(script) + "\n")
+    subprocess.run([gnuplot, path], check=True)
+    print(f"wrote {chart_png}")
+
+
+def main():
+    here = os.path.dirname(os.path.abspath(__file__))
+    p = argparse.ArgumentParser(description=__doc__.split("\n")[0])
+    p.add_argument("--build", default=os.path.join(os.path.dirname(here), "build"),
+                   help="build directory holding bench/peers_benchmark")
+    p.add_argument("--n", default="100000,1000000", help="workload sizes, comma separated")
+    p.add_argument("--backends", default=",".join(BACKEND_ORDER))
+    p.add_argument("--workloads", default="W1,W2,W3,W4,W5,W6")
+    p.add_argument("--big-n", default="", help="extra sizes run only on --big-backends")
+    p.add_argument("--big-backends", default="store,sqlite")
+    p.add_argument("--big-workloads", default="W1,W3,W4")
+    p.add_argument("--reps", type=int, default=3, help="repetitions of store and raw SQLite")
+    p.add_argument("--peer-reps", type=int, default=1, help="repetitions of the other backends")
+    p.add_argument("--scratch", default="", help="scratch root (default: beside the program)")
+    p.add_argument("--fresh", action="store_true", help="start the results file over")
+    p.add_argument("--render-only", action="store_true", help="only rewrite the report")
+    p.add_argument("--results", default="", help="results file (default: <build>/peers-results.jsonl)")
+    p.add_argument("--out", default=here, help="where RESULTS.md and peers.png go")
+    args = p.parse_args()
+    args.build = os.path.abspath(args.build)
+    program = os.path.join(args.build, "bench", "peers_benchmark")
+    results = args.results or os.path.join(args.build, "peers-results.jsonl")
+    command = shlex.join(["bench/run_peers.py"] + sys.argv[1:])
+    if not args.render_only:
+        if not os.access(program, os.X_OK):
+            sys.exit(f"{program} not built (cmake --build {args.build} --target peers_benchmark)")
+        if args.fresh:
+            for path in (results, results + ".commands"):
+                if os.path.exists(path):
+                    os.remove(path)
+        with open(results + ".commands", "a") as f:
+            f.write(command + "\n")
+        measure(args, program, results)
+    rows = load(results)
+    if os.path.exists(results + ".commands"):
+        with open(results + ".commands") as f:
+            command = "`; `".join(line.strip() for line in f if line.strip())
+    if not rows:
+        sys.exit("no results")
+    render(args, rows, os.path.join(args.out, "RESULTS.md"), os.path.join(args.out, "peers.png"),
+           command)
+
+
+if __name__ == "__main__":
+    main()
