@@ -146,49 +146,51 @@ bool KovBtreeCursor::indexKeySeek(const void* key, std::uint64_t size) {
     return none == 0;
 }
 
-// Composite keys live on byte-string tables; on an integer-keyed table the "key length" the
-// engine reports is the integer key itself, so no fetch is attempted there.
+// Composite keys are byte strings. The engine lends the current key in place: the prefix is
+// compared there and the payload copied out of it, so no key is copied that the caller did not ask
+// for. On no entry (or with no engine cursor) the key reads as empty. A cursor opened on an
+// IntKeyTable, or standing on an integer key (a cursor kept over a reset may have been reopened
+// on such a table), has no key bytes and fetches nothing.
+const unsigned char* KovBtreeCursor::currentKey(std::uint32_t& length) {
+    length = 0;
+    if (slotIndex_ < registry_->size() &&
+        ((*registry_)[slotIndex_].tableFlags & eng::BTREE_INTKEY) != 0)
+        return nullptr;  // opened on an IntKeyTable
+    eng::BtCursor* cursor = handle();
+    const void* key = eng::sqlite3BtreeKeyFetch(cursor, &length);
+    if (key == nullptr && eng::sqlite3BtreeEof(cursor) == 0)
+        return nullptr;  // on an entry whose key is an integer
+    static const unsigned char kEmptyKey = 0;
+    return key != nullptr ? static_cast<const unsigned char*>(key) : &kEmptyKey;
+}
+
 bool KovBtreeCursor::indexKeyFetch(const void* prefix, std::uint64_t prefixSize, void* payload,
                                    std::uint64_t payloadSize) {
-    if (onIntegerTable())
+    std::uint32_t length = 0;
+    const unsigned char* key = currentKey(length);
+    if (key == nullptr || length != prefixSize + payloadSize)
         return false;
-    const std::int64_t keyLength = keySize();
-    if (static_cast<std::uint64_t>(keyLength) != prefixSize + payloadSize)
-        return false;
-    return fetchPayload(prefix, prefixSize, payload, payloadSize);
+    return matchAndCopy(key, prefix, prefixSize, payload, payloadSize);
 }
 
 bool KovBtreeCursor::indexKeyFetch(const void* prefix, std::uint64_t prefixSize,
                                    std::string& payload) {
-    if (onIntegerTable())
-        return false;
-    const std::int64_t keyLength = keySize();
+    std::uint32_t length = 0;
+    const unsigned char* key = currentKey(length);
     // A key shorter than the prefix cannot begin with it (this covers a cursor on no entry).
-    if (keyLength < 0 || static_cast<std::uint64_t>(keyLength) < prefixSize)
+    if (key == nullptr || length < prefixSize)
         return false;
-    payload.resize(static_cast<std::size_t>(static_cast<std::uint64_t>(keyLength) - prefixSize));
-    return fetchPayload(prefix, prefixSize, payload.data(), payload.size());
+    payload.resize(static_cast<std::size_t>(length - prefixSize));
+    return matchAndCopy(key, prefix, prefixSize, payload.data(), payload.size());
 }
 
-// The current key is known to be prefixSize + payloadSize bytes long. The engine lends it in
-// place: the prefix is compared there and, on a match, the payload copied out of it, so no key is
-// copied that the caller did not ask for. A mismatch leaves the payload buffer untouched. With no
-// entry (or no engine cursor) the key reads as empty.
-bool KovBtreeCursor::fetchPayload(const void* prefix, std::uint64_t prefixSize, void* payload,
+// A mismatch leaves the payload buffer untouched.
+bool KovBtreeCursor::matchAndCopy(const unsigned char* key, const void* prefix,
+                                  std::uint64_t prefixSize, void* payload,
                                   std::uint64_t payloadSize) {
-    std::uint32_t available = 0;
-    const auto* key =
-        static_cast<const unsigned char*>(eng::sqlite3BtreeKeyFetch(handle(), &available));
-    if (available != prefixSize + payloadSize)
-        return false;
     if (prefixSize > 0 && std::memcmp(key, prefix, static_cast<std::size_t>(prefixSize)) != 0)
         return false;
     if (payloadSize > 0)
         std::memcpy(payload, key + prefixSize, static_cast<std::size_t>(payloadSize));
     return true;
-}
-
-bool KovBtreeCursor::onIntegerTable() const {
-    return slotIndex_ < registry_->size() &&
-           ((*registry_)[slotIndex_].tableFlags & eng::BTREE_INTKEY) != 0;
 }

@@ -143,12 +143,13 @@ class KOVPAGER_EXPORT KovBtreeCursor {
     // The engine cursor in this cursor's slot; null when refused or after the pager's teardown.
     kov::engine::BtCursor* handle() const;
 
-    // The two indexKeyFetch forms once the key length is known to be prefixSize + payloadSize.
-    bool fetchPayload(const void* prefix, std::uint64_t prefixSize, void* payload,
-                      std::uint64_t payloadSize);
+    // The current key's bytes in place and their count: the empty key on no entry, null for a
+    // cursor opened on an IntKeyTable or standing on an integer key.
+    const unsigned char* currentKey(std::uint32_t& length);
 
-    // True when this cursor's table has integer keys (composite keys are never fetched there).
-    bool onIntegerTable() const;
+    // True when `key` begins with the prefix; the payload that follows is then copied out.
+    static bool matchAndCopy(const unsigned char* key, const void* prefix,
+                             std::uint64_t prefixSize, void* payload, std::uint64_t payloadSize);
 
     std::vector<CursorSlot>* registry_;
     std::uint64_t slotIndex_;

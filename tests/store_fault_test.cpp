@@ -293,3 +293,19 @@ TEST(StoreFaults, TheStepAfterAFaultIsCheckedAgainstTheEngineReadBack) {
     EXPECT_EQ(r.mismatches, 0u);
     EXPECT_GT(r.operations, 1000u);
 }
+
+// Found by the soak program (run seed 70416396, whose fault never fires): a cursor kept over a
+// reset is reopened on an integer-keyed table of the new engine while its slot still says
+// byte-string keys. indexKeyFetch took the integer key for a key length (a large one would have
+// asked for a payload string of that size), and the model expected a byte key. Composite keys
+// are now fetched only from byte-string keys, in the store and in the model, and the whole run
+// matches.
+TEST(StoreFaults, RegressionSeed70416396FetchOnACursorReopenedOnAnIntegerTable) {
+    ScopedFaultVfs vfs;
+    const kovtest::RandomFaultRun run(70416396u);
+    const kovtest::RandomFaultResult r = kovtest::runRandomFaultRun(vfs.faults(), run, 16, false);
+    EXPECT_TRUE(run.allowReset);
+    EXPECT_EQ(r.report.faultedSteps, 0u);
+    EXPECT_EQ(r.operations, static_cast<std::uint64_t>(kovtest::RandomFaultRun::kSteps));
+    EXPECT_EQ(r.mismatches, 0u);
+}

@@ -886,7 +886,9 @@ class StoreProgram {
         ModelSlot& s = slots_[c.slot];
         ModelTable* t = tableOf(s);
         noteBroken(s);
-        bool intTable = (s.flags & 1) != 0;
+        // Nothing is fetched on a cursor opened on an integer-keyed table, nor on one standing on
+        // an integer key (a slot kept over a reset may have been reopened on such a table).
+        bool intTable = (s.flags & 1) != 0 || (t != nullptr && t->intKey && s.on);
         if (intKeyed(c) && !opt_.oddInputs)
             return;
         std::string prefix = randomBytes().substr(0, static_cast<std::size_t>(pick(3)));
