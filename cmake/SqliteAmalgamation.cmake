@@ -44,6 +44,29 @@ target_include_directories(kovpager_sqlite3 SYSTEM PUBLIC "${_kov_sqlite_dir}")
 # for export leaves a DLL unless nothing is, the archive is also excluded
 # from automatic export.
 target_compile_definitions(kovpager_sqlite3 PRIVATE SQLITE_API=)
+# The same compile-time options as Debian's own libsqlite3 (debian/rules of
+# the source package), so the engine behaves alike on both platforms, down
+# to the order of its file reads and writes.
+target_compile_definitions(kovpager_sqlite3 PRIVATE
+  SQLITE_SECURE_DELETE SQLITE_ENABLE_COLUMN_METADATA
+  SQLITE_ENABLE_FTS3 SQLITE_ENABLE_FTS3_PARENTHESIS
+  SQLITE_ENABLE_RTREE=1 SQLITE_SOUNDEX=1
+  SQLITE_ENABLE_UNLOCK_NOTIFY
+  SQLITE_OMIT_LOOKASIDE=1 SQLITE_ENABLE_DBSTAT_VTAB
+  SQLITE_ALLOW_ROWID_IN_VIEW
+  SQLITE_ENABLE_UPDATE_DELETE_LIMIT=1
+  SQLITE_ENABLE_LOAD_EXTENSION
+  SQLITE_ENABLE_JSON1
+  SQLITE_LIKE_DOESNT_MATCH_BLOBS
+  SQLITE_THREADSAFE=1
+  SQLITE_ENABLE_FTS3_TOKENIZER=1
+  SQLITE_USE_URI=1
+  SQLITE_MAX_SCHEMA_RETRY=25
+  SQLITE_ENABLE_PREUPDATE_HOOK
+  SQLITE_ENABLE_SESSION
+  SQLITE_ENABLE_STMTVTAB
+  SQLITE_MAX_VARIABLE_NUMBER=250000)
+target_compile_options(kovpager_sqlite3 PRIVATE -fno-strict-aliasing)
 set_target_properties(kovpager_sqlite3 PROPERTIES
   C_VISIBILITY_PRESET hidden
   POSITION_INDEPENDENT_CODE ON)

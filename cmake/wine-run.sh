@@ -12,6 +12,8 @@
 #           parallel test runs never race to build it.
 # --path    a directory searched for DLLs (Wine's WINEPATH); may be repeated.
 # --init    only make sure the prefix exists.
+# Besides C: and Z: (the Unix root) the prefix has a drive D: on its own
+# drive_d directory and the share \\localhost\C$ (see below).
 # KOVPAGER_WINE names the Wine program (default /usr/lib/wine/wine64);
 # KOVPAGER_WINESERVER_LINGER the seconds the Wine server stays up after the
 # last program (default 10).
@@ -84,6 +86,17 @@ if [ ! -e "$prefix/.kovpager-ready" ]; then
         fi
     ) 9>"$prefix.lock"
 fi
+# Drives the tests rely on besides C: and Z:, added to any prefix, new or
+# made by an older version of this script; each link is made atomically, so
+# parallel runs at worst both try:
+#  - D:, a second local drive on a directory of the prefix (drive_d, with a
+#    tmp directory in it), for moves between drives;
+#  - \\localhost\C$, the system drive's administrative share, which Wine
+#    serves from the prefix's dosdevices/unc tree.
+mkdir -p "$prefix/drive_d/tmp" "$prefix/dosdevices/unc/localhost"
+[ -L "$prefix/dosdevices/d:" ] || ln -s ../drive_d "$prefix/dosdevices/d:" 2>/dev/null || true
+[ -L "$prefix/dosdevices/unc/localhost/c\$" ] ||
+    ln -s ../../../drive_c "$prefix/dosdevices/unc/localhost/c\$" 2>/dev/null || true
 [ "$init_only" -eq 1 ] && exit 0
 
 if [ $# -eq 0 ]; then

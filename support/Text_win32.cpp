@@ -40,13 +40,16 @@ bool wideToAnsi(const std::wstring& wide, bool strict, std::string& out) {
     if (wide.size() > static_cast<std::size_t>(INT_MAX))
         return false;
     BOOL usedDefault = FALSE;
-    const int n = WideCharToMultiByte(CP_ACP, 0, wide.data(), static_cast<int>(wide.size()),
-                                      nullptr, 0, nullptr, strict ? &usedDefault : nullptr);
+    // No best-fit mapping: a character the code page lacks is not swapped for a look-alike
+    // (an omega for "O"); it is refused (strict) or becomes the default character (lossy).
+    const int n = WideCharToMultiByte(CP_ACP, WC_NO_BEST_FIT_CHARS, wide.data(),
+                                      static_cast<int>(wide.size()), nullptr, 0, nullptr,
+                                      strict ? &usedDefault : nullptr);
     if (n <= 0 || (strict && usedDefault))
         return false;
     out.resize(static_cast<std::size_t>(n));
-    return WideCharToMultiByte(CP_ACP, 0, wide.data(), static_cast<int>(wide.size()), &out[0], n,
-                               nullptr, nullptr) == n;
+    return WideCharToMultiByte(CP_ACP, WC_NO_BEST_FIT_CHARS, wide.data(),
+                               static_cast<int>(wide.size()), &out[0], n, nullptr, nullptr) == n;
 }
 
 std::wstring toWstring(const std::u16string& s) {

@@ -1,6 +1,6 @@
-// A host module of the store, for the load and unload tests: a shared object that links the
-// shared library and drives one integer-keyed table through a C interface, so that a test program
-// can load it with dlopen, fill the store and unload both again.
+// A host module of the store, for the load and unload tests: a shared object (a DLL on Windows)
+// that links the shared library and drives one integer-keyed table through a C interface, so that
+// a test program can load it with dlopen (LoadLibrary), fill the store and unload both again.
 #include <cstdint>
 #include <cstring>
 #include <memory>
@@ -9,7 +9,11 @@
 #include <kovpager/KovBtree.h>
 #include <kovpager/KovBtreeCursor.h>
 
+#if defined(_WIN32)
+#define KOV_PLUGIN_API extern "C" __declspec(dllexport)
+#else
 #define KOV_PLUGIN_API extern "C" __attribute__((visibility("default")))
+#endif
 
 namespace {
 

@@ -182,7 +182,9 @@ TEST_F(SupportWin32, CreateCopyMoveAndRemoveInAScratchDirectory) {
 }
 
 TEST_F(SupportWin32, MovingAcrossDrivesCopiesThenDeletes) {
-    // Needs a second writable drive (under Wine, Z: maps the Unix root).
+    // Needs a second writable drive: the first fixed drive after the scratch
+    // directory's own with a \tmp or \temp in it. (The Wine prefix of the
+    // cross build maps D: to a directory of its own for this.)
     const std::string own = scratch_.path(2).substr(0, 2);
     std::string otherDir;
     const DWORD drives = GetLogicalDrives();
@@ -211,6 +213,7 @@ TEST_F(SupportWin32, MovingAcrossDrivesCopiesThenDeletes) {
     }
     if (otherDir.empty())
         GTEST_SKIP() << "no second writable drive";
+    RecordProperty("other_directory", otherDir);
     KovFile f(Utf8Text(at("cross.bin")));
     ASSERT_TRUE(f.create());
     const bool moved = f.moveTo(otherDir + "\\cross.bin", false);

@@ -195,6 +195,43 @@ TEST_F(TempDirWin32Test, ForwardSlashesAndATrailingSlashComeBackWithBackslashes)
     EXPECT_EQ(source(), "KOV_TEMP");
 }
 
+// The value D:/scratch/ itself, where there is a drive D: (the Wine prefix of the cross build
+// maps one); the directory is made for the test when it is missing and removed again after.
+TEST_F(TempDirWin32Test, DriveDScratchWithForwardSlashesComesBackAsDScratch) {
+    const UINT type = ::GetDriveTypeA("D:\\");
+    if (type != DRIVE_FIXED && type != DRIVE_REMOTE && type != DRIVE_RAMDISK) {
+        GTEST_SKIP() << "no drive D: here";
+    }
+    const bool made = !isDirectory("D:\\scratch");
+    if (made) {
+        ASSERT_TRUE(::CreateDirectoryA("D:\\scratch", nullptr) != 0);
+    }
+    setVariable("KOV_TEMP", "D:/scratch/");
+    const std::string found = kov::getTempDirectory();
+    const std::string from = source();
+    if (made) {
+        ::RemoveDirectoryA("D:\\scratch");
+    }
+    EXPECT_EQ(found, "D:\\scratch");
+    EXPECT_EQ(from, "KOV_TEMP");
+}
+
+// A directory whose name needs the ANSI code page comes back in it, byte for byte: the search
+// takes the narrow text through UTF-8 and back.
+TEST_F(TempDirWin32Test, NonAsciiDirectoryComesBackInTheAnsiCodePage) {
+    if (::GetACP() != 1252) {
+        GTEST_SKIP() << "ANSI code page " << ::GetACP() << ", not 1252";
+    }
+    const std::string dir = at("caf\xE9");  // "café" in code page 1252
+    ASSERT_TRUE(::CreateDirectoryA(dir.c_str(), nullptr) != 0) << dir;
+    ASSERT_TRUE(
+        ::GetFileAttributesW((std::wstring(base_.begin(), base_.end()) + L"\\caf\u00E9").c_str()) !=
+        INVALID_FILE_ATTRIBUTES);
+    setVariable("TMP", forwardSlashes(dir));
+    EXPECT_EQ(kov::getTempDirectory(), dir);
+    EXPECT_EQ(source(), "TMP");
+}
+
 TEST_F(TempDirWin32Test, DoubledSeparatorsAreCollapsed) {
     const std::string inner = makeDirectory("a\\b");
     setVariable("TEMP", forwardSlashes(base_) + "//a\\\\b\\");
@@ -245,13 +282,67 @@ TEST_F(TempDirWin32Test, LocalAppDataTempWinsWhenNoVariableIsUsable) {
     EXPECT_EQ(source(), "");
 }
 
-TEST_F(TempDirWin32Test, FixedFallbacksAreCTempThenCTmpInNativeForm) {
-    // The last two candidates of the fixed list, searched alone: c:\temp when it exists, otherwise
-    // c:\tmp, created when missing and returned even when it could not be made.
+// The last two candidates of the fixed list, searched alone: c:\temp when it exists, and c:\tmp
+// is then neither tested nor made.
+TEST_F(TempDirWin32Test, FixedFallbackCTempWinsWhenItExists) {
     const std::vector<TempDirectoryCandidate> list = kov::tempDirectoryCandidates();
     ASSERT_EQ(list.size(), 6u);
-    const std::string expected = isDirectory("c:\\temp") ? "c:\\temp" : "c:\\tmp";
+    const bool tmpBefore = existsAtAll("c:\\tmp");
+    const bool made = !isDirectory("c:\\temp");
+    if (made) {
+        ASSERT_TRUE(::CreateDirectoryA("c:\\temp", nullptr) != 0);
+    }
     const kov::TempDirectorySearchResult found = kov::searchTempDirectory({list[4], list[5]});
+    const bool tmpAfter = existsAtAll("c:\\tmp");
+    if (made) {
+        ::RemoveDirectoryA("c:\\temp");
+    }
+    EXPECT_EQ(found.path, "c:\\temp");
+    EXPECT_EQ(found.source, "");
+    EXPECT_EQ(tmpAfter, tmpBefore);
+}
+
+// Without c:\temp, c:\tmp is created and returned in native form. Runs where c:\temp is missing
+// and c:\tmp is missing or an empty directory (which is removed first, and is there again after).
+TEST_F(TempDirWin32Test, FixedFallbackCTmpIsCreatedWhenMissing) {
+    const std::vector<TempDirectoryCandidate> list = kov::tempDirectoryCandidates();
+    ASSERT_EQ(list.size(), 6u);
+    if (existsAtAll("c:\\temp")) {
+        GTEST_SKIP() << "c:\\temp exists here";
+    }
+    if (existsAtAll("c:\\tmp") && ::RemoveDirectoryA("c:\\tmp") == 0) {
+        GTEST_SKIP() << "c:\\tmp exists here and is not an empty directory";
+    }
+    ASSERT_FALSE(existsAtAll("c:\\tmp"));
+    const kov::TempDirectorySearchResult found = kov::searchTempDirectory({list[4], list[5]});
+    EXPECT_EQ(found.path, "c:\\tmp");
+    EXPECT_EQ(found.source, "");
+    EXPECT_TRUE(isDirectory("c:\\tmp"));
+    EXPECT_FALSE(existsAtAll("c:\\temp"));
+}
+
+// The whole list with nothing usable before the fixed fallbacks: the variables name nothing and
+// the shell folder's candidate is missing (its locator stands in for a shell folder without Temp,
+// and, in the second search, for a failed shell call); the answer is c:\temp or c:\tmp.
+TEST_F(TempDirWin32Test, NothingUsableEndsAtTheFixedFallbacks) {
+    std::vector<TempDirectoryCandidate> list = kov::tempDirectoryCandidates();
+    ASSERT_EQ(list.size(), 6u);
+    setVariable("KOV_TEMP", at("missing"));
+    setVariable("TMP", makeFile("plain"));
+    const std::string missingTemp = at("local") + "/Temp";
+    list[3] = TempDirectoryCandidate::located("shell folder without Temp",
+                                              [missingTemp] { return missingTemp; });
+    const std::string expected = isDirectory("c:\\temp") ? "c:\\temp" : "c:\\tmp";
+    kov::TempDirectorySearchResult found = kov::searchTempDirectory(list);
+    EXPECT_EQ(found.path, expected);
+    EXPECT_EQ(found.source, "");
+    EXPECT_TRUE(isDirectory(expected));
+    EXPECT_FALSE(existsAtAll(at("missing")));
+    EXPECT_FALSE(existsAtAll(at("local")));
+
+    list[3] = TempDirectoryCandidate::located("failed shell call",
+                                              [] { return std::optional<std::string>(); });
+    found = kov::searchTempDirectory(list);
     EXPECT_EQ(found.path, expected);
     EXPECT_EQ(found.source, "");
 }

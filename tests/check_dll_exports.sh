@@ -1,0 +1,41 @@
+#!/bin/sh
+# Fails when the DLL exports any name that is not a member of KovPager,
+# KovBtree or KovBtreeCursor, or any name of the engine (sqlite3_*).
+#   tests/check_dll_exports.sh <path to libkovpager.dll> [objdump]
+# objdump defaults to x86_64-w64-mingw32-objdump; the demangler is the
+# c++filt beside it (x86_64-w64-mingw32-c++filt), else the host's c++filt.
+set -eu
+dll=$1
+objdump=${2:-x86_64-w64-mingw32-objdump}
+cxxfilt=$(printf '%s' "$objdump" | sed 's/objdump$/c++filt/')
+if [ "$cxxfilt" = "$objdump" ] || ! command -v "$cxxfilt" >/dev/null 2>&1; then
+    cxxfilt=c++filt
+fi
+command -v "$objdump" >/dev/null 2>&1 || { echo "$objdump not found" >&2; exit 1; }
+
+# The export table's names: the lines "[ n] name" after "[Ordinal/Name Pointer] Table".
+raw=$("$objdump" -p "$dll" | awk '
+    /^\[Ordinal\/Name Pointer\] Table/ { inside = 1; next }
+    inside && /^[ \t]*\[ *[0-9]+\]/ { sub(/^[ \t]*\[ *[0-9]+\][ \t]*/, ""); print; next }
+    inside { exit }')
+[ -n "$raw" ] || { echo "no exported names found in $dll" >&2; exit 1; }
+
+engine=$(printf '%s\n' "$raw" | grep -E '^_?sqlite3' || true)
+if [ -n "$engine" ]; then
+    echo "engine names exported:" >&2
+    printf '%s\n' "$engine" >&2
+    exit 1
+fi
+
+symbols=$(printf '%s\n' "$raw" | "$cxxfilt")
+stray=$(printf '%s\n' "$symbols" | grep -v -E '^(KovPager|KovBtree|KovBtreeCursor)::' || true)
+classes=$(printf '%s\n' "$symbols" | grep -c -E '^(KovPager|KovBtree|KovBtreeCursor)::' || true)
+if [ -n "$stray" ]; then
+    echo "names exported outside the three classes:" >&2
+    printf '%s\n' "$stray" >&2
+    exit 1
+fi
+for class in KovPager KovBtree KovBtreeCursor; do
+    printf '%s\n' "$symbols" | grep -q -E "^$class::" || { echo "$class exports nothing" >&2; exit 1; }
+done
+echo "$classes names exported, all members of the three classes"
