@@ -37,6 +37,7 @@
 #include <cstring>
 #include <stdexcept>
 #include <string>
+#include <vector>
 
 namespace kov::bench {
 
@@ -104,6 +105,24 @@ class RawStatement {
         return static_cast<std::size_t>(sqlite3_column_bytes(stmt_, column));
     }
     std::int64_t integer(int column) const { return sqlite3_column_int64(stmt_, column); }
+
+    // Steps over up to `count` rows, copying each row's key and data
+    // (columns 0 and 1) into the buffers and handing them to
+    // visit(key, keySize, data): a scan that reads what it walks.
+    template <typename Visit>
+    void copyRows(std::size_t count, std::vector<unsigned char>& keyBuf,
+                  std::vector<unsigned char>& dataBuf, Visit visit) {
+        for (std::size_t i = 0; i < count && step(); ++i) {
+            std::size_t keySize = bytes(0);
+            std::size_t dataSize = bytes(1);
+            if (keySize > keyBuf.size() || dataSize > dataBuf.size()) {
+                throw std::runtime_error("raw scan: entry larger than expected");
+            }
+            std::memcpy(keyBuf.data(), blob(0), keySize);
+            std::memcpy(dataBuf.data(), blob(1), dataSize);
+            visit(keyBuf.data(), keySize, dataBuf.data());
+        }
+    }
 
   private:
     void check(int rc, const char* what) {

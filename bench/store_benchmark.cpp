@@ -250,16 +250,9 @@ void BM_OrderedScan(benchmark::State& state) {
             timer.run(
                 n, kScanChunk,
                 [&](std::size_t begin, std::size_t end) {
-                    for (std::size_t i = begin; i < end && scan.step(); ++i) {
-                        std::size_t keySize = scan.bytes(0);
-                        std::size_t dataSize = scan.bytes(1);
-                        if (keySize > keyBuf.size() || dataSize > dataBuf.size()) {
-                            throw std::runtime_error("raw scan: entry larger than expected");
-                        }
-                        std::memcpy(keyBuf.data(), scan.blob(0), keySize);
-                        std::memcpy(dataBuf.data(), scan.blob(1), dataSize);
-                        raw.add(keyBuf.data(), keySize, dataBuf.data());
-                    }
+                    scan.copyRows(end - begin, keyBuf, dataBuf,
+                                  [&](const unsigned char* key, std::size_t keySize,
+                                      const unsigned char* data) { raw.add(key, keySize, data); });
                 },
                 [&](std::size_t begin, std::size_t end) {
                     for (std::size_t i = begin; i < end; ++i) {
