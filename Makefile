@@ -7,7 +7,12 @@ JOBS       ?= $(shell nproc 2>/dev/null || echo 2)
 CMAKE_ARGS ?=
 CTEST_ARGS ?=
 
-DEPS_PACKAGES = cmake make g++ pkg-config libsqlite3-dev libgtest-dev libgmock-dev libbenchmark-dev
+# dpkg-dev (apt-get source) and tcl (tclsh) make the library's SQLite from
+# Debian's sqlite3 sources (cmake/fetch-sqlite-amalgamation.sh, run once per
+# checkout by the first configure); libsqlite3-dev is the system SQLite that
+# the benchmarks' baseline and a test host link.
+DEPS_PACKAGES = cmake make gcc g++ pkg-config dpkg-dev tcl util-linux libsqlite3-dev \
+                libgtest-dev libgmock-dev libbenchmark-dev
 
 .PHONY: all deps configure build demo test bench bench-run bench-peers soak install clean
 

@@ -1,81 +1,112 @@
-# SQLite for the Windows build. Windows has no system SQLite to link, so the
-# amalgamation is generated from Debian's sqlite3 source package by
-# cmake/fetch-sqlite-amalgamation.sh and compiled with the cross-compiler into
-# a static library, which the DLL takes in whole. Its symbols stay inside the
-# DLL: nothing of SQLite is exported, so a host's own SQLite never meets ours.
+# The library's private SQLite, on every platform.
 #
-# Defines SQLite::SQLite3, the same target name that find_package(SQLite3)
-# gives on Linux, with the directory holding sqlite3.h as its include dir.
+# SQLite's amalgamation is made from Debian's sqlite3 source package by
+# cmake/fetch-sqlite-amalgamation.sh, once per checkout, into
+# KOVPAGER_SQLITE_DIR (third_party/sqlite, not committed); every build
+# directory of the checkout (build, build-asan, build-release, the Windows
+# build ...) compiles that one copy. It is compiled into the library by
+# engine/sqlite_btree.c, the one unit that uses SQLite's internal B-tree
+# layer (engine/CMakeLists.txt).
 #
-# The generated sources are cached in KOVPAGER_SQLITE_CACHE_DIR (default: in
-# the build directory); the first build makes them, later builds, and builds
-# after a clean, only copy them.
+# Nothing of it can meet a host's SQLite:
+#   * every public SQLite name is renamed: sqlite3_open_v2 becomes
+#     kovpager_sqlite3_open_v2, and so on (the generated header
+#     kovpager_sqlite3_names.h), so even a program that links the library's
+#     internal archive and the system SQLite gets two separate engines;
+#   * the names are hidden: the shared library exports none of them.
+#
+# Defined here:
+#   KOVPAGER_SQLITE_DIR            sqlite3.c, sqlite3.h, VERSION
+#   KOVPAGER_SQLITE_VERSION_NUMBER the version the binding was checked against
+#   KOVPAGER_SQLITE_OPTIONS        SQLite's compile-time options (below)
+#   kovpager_sqlite_api            an INTERFACE target: include
+#                                  "engine/private_sqlite3.h" to call the
+#                                  library's SQLite (the engine and tests)
 
-set(KOVPAGER_SQLITE_CACHE_DIR "${PROJECT_BINARY_DIR}/sqlite-amalgamation" CACHE PATH
-    "Where the SQLite amalgamation is generated and kept")
+set(KOVPAGER_SQLITE_DIR "${PROJECT_SOURCE_DIR}/third_party/sqlite" CACHE PATH
+    "Where the SQLite amalgamation is generated, once per checkout")
 
-set(_kov_sqlite_dir "${PROJECT_BINARY_DIR}/sqlite3")
-file(MAKE_DIRECTORY "${_kov_sqlite_dir}")
+# engine/sqlite_btree.c leans on SQLite's internal B-tree interface, which
+# has no stability promise; it was checked against this version only.
+set(KOVPAGER_SQLITE_VERSION_NUMBER 3040001)
 
-# No DEPENDS: the amalgamation is a fixed input, made once when missing.
-add_custom_command(
-  OUTPUT "${_kov_sqlite_dir}/sqlite3.c" "${_kov_sqlite_dir}/sqlite3.h"
-  COMMAND sh "${PROJECT_SOURCE_DIR}/cmake/fetch-sqlite-amalgamation.sh"
-          "${KOVPAGER_SQLITE_CACHE_DIR}"
-  COMMAND "${CMAKE_COMMAND}" -E copy
-          "${KOVPAGER_SQLITE_CACHE_DIR}/sqlite3.c"
-          "${KOVPAGER_SQLITE_CACHE_DIR}/sqlite3.h"
-          "${KOVPAGER_SQLITE_CACHE_DIR}/sqlite3ext.h"
-          "${_kov_sqlite_dir}/"
-  COMMENT "SQLite amalgamation from Debian's sqlite3 sources"
-  VERBATIM)
-add_custom_target(kovpager_sqlite3_sources
-  DEPENDS "${_kov_sqlite_dir}/sqlite3.c" "${_kov_sqlite_dir}/sqlite3.h")
-
-add_library(kovpager_sqlite3 STATIC "${_kov_sqlite_dir}/sqlite3.c")
-# Everything that includes sqlite3.h waits for it through this dependency.
-add_dependencies(kovpager_sqlite3 kovpager_sqlite3_sources)
-# As a system header, like the Linux one: the project's warning flags are not
-# applied to it.
-target_include_directories(kovpager_sqlite3 SYSTEM PUBLIC "${_kov_sqlite_dir}")
-# SQLITE_API empty: the functions are plain externals of the static library,
-# neither exported from nor imported into a DLL. On ELF platforms the hidden
-# visibility below keeps them local; on Windows, where only what is marked
-# for export leaves a DLL unless nothing is, the archive is also excluded
-# from automatic export.
-target_compile_definitions(kovpager_sqlite3 PRIVATE SQLITE_API=)
-# The same compile-time options as Debian's own libsqlite3 (debian/rules of
-# the source package), so the engine behaves alike on both platforms, down
-# to the order of its file reads and writes.
-target_compile_definitions(kovpager_sqlite3 PRIVATE
-  SQLITE_SECURE_DELETE SQLITE_ENABLE_COLUMN_METADATA
-  SQLITE_ENABLE_FTS3 SQLITE_ENABLE_FTS3_PARENTHESIS
-  SQLITE_ENABLE_RTREE=1 SQLITE_SOUNDEX=1
-  SQLITE_ENABLE_UNLOCK_NOTIFY
-  SQLITE_OMIT_LOOKASIDE=1 SQLITE_ENABLE_DBSTAT_VTAB
-  SQLITE_ALLOW_ROWID_IN_VIEW
-  SQLITE_ENABLE_UPDATE_DELETE_LIMIT=1
-  SQLITE_ENABLE_LOAD_EXTENSION
-  SQLITE_ENABLE_JSON1
-  SQLITE_LIKE_DOESNT_MATCH_BLOBS
-  SQLITE_THREADSAFE=1
-  SQLITE_ENABLE_FTS3_TOKENIZER=1
-  SQLITE_USE_URI=1
-  SQLITE_MAX_SCHEMA_RETRY=25
-  SQLITE_ENABLE_PREUPDATE_HOOK
-  SQLITE_ENABLE_SESSION
-  SQLITE_ENABLE_STMTVTAB
-  SQLITE_MAX_VARIABLE_NUMBER=250000)
-target_compile_options(kovpager_sqlite3 PRIVATE -fno-strict-aliasing)
-set_target_properties(kovpager_sqlite3 PROPERTIES
-  C_VISIBILITY_PRESET hidden
-  POSITION_INDEPENDENT_CODE ON)
-if(MINGW)
-  target_compile_options(kovpager_sqlite3 PRIVATE -fvisibility=hidden)
-  target_link_options(kovpager_sqlite3 INTERFACE
-    "$<$<STREQUAL:$<TARGET_PROPERTY:TYPE>,SHARED_LIBRARY>:LINKER:--exclude-libs,$<TARGET_FILE_NAME:kovpager_sqlite3>>")
+if(NOT EXISTS "${KOVPAGER_SQLITE_DIR}/.complete")
+  message(STATUS "Making the SQLite amalgamation from Debian's sqlite3 sources in ${KOVPAGER_SQLITE_DIR}")
+  execute_process(
+    COMMAND sh "${PROJECT_SOURCE_DIR}/cmake/fetch-sqlite-amalgamation.sh" "${KOVPAGER_SQLITE_DIR}"
+    RESULT_VARIABLE _kov_fetch_rc)
+  if(NOT _kov_fetch_rc EQUAL 0)
+    message(FATAL_ERROR
+      "Could not make the SQLite amalgamation in ${KOVPAGER_SQLITE_DIR} (see the messages "
+      "above). As root: sh cmake/fetch-sqlite-amalgamation.sh ${KOVPAGER_SQLITE_DIR}")
+  endif()
 endif()
-find_package(Threads REQUIRED)
-target_link_libraries(kovpager_sqlite3 PUBLIC Threads::Threads)
 
-add_library(SQLite::SQLite3 ALIAS kovpager_sqlite3)
+file(STRINGS "${KOVPAGER_SQLITE_DIR}/sqlite3.h" _kov_sqlite_version_line
+     REGEX "^#define SQLITE_VERSION_NUMBER [0-9]+")
+string(REGEX MATCH "[0-9]+$" _kov_sqlite_version "${_kov_sqlite_version_line}")
+if(NOT _kov_sqlite_version STREQUAL KOVPAGER_SQLITE_VERSION_NUMBER)
+  message(FATAL_ERROR
+    "The SQLite amalgamation in ${KOVPAGER_SQLITE_DIR} is version ${_kov_sqlite_version}, but "
+    "engine/sqlite_btree.c was checked against ${KOVPAGER_SQLITE_VERSION_NUMBER} only: it uses "
+    "SQLite's internal B-tree interface, which changes between versions. Check every internal "
+    "function and structure named at the top of engine/sqlite_btree.c against the new version, "
+    "then update KOVPAGER_SQLITE_VERSION_NUMBER here and in that file.")
+endif()
+
+# The rename header: every name that sqlite3.c declares with SQLITE_API.
+set(KOVPAGER_SQLITE_GENERATED "${PROJECT_BINARY_DIR}/private-sqlite")
+set(_kov_names_header "${KOVPAGER_SQLITE_GENERATED}/kovpager_sqlite3_names.h")
+if(NOT EXISTS "${_kov_names_header}"
+   OR "${KOVPAGER_SQLITE_DIR}/sqlite3.c" IS_NEWER_THAN "${_kov_names_header}")
+  file(STRINGS "${KOVPAGER_SQLITE_DIR}/sqlite3.c" _kov_api_lines REGEX "^SQLITE_API ")
+  set(_kov_names "")
+  foreach(_line IN LISTS _kov_api_lines)
+    # The declared name is the identifier that a '(', ';', '[' or '=' follows
+    # (a type such as sqlite3_int64 before it is followed by a space).
+    if(_line MATCHES "(sqlite3[A-Za-z0-9_]*)[ ]*[(;[=]")
+      list(APPEND _kov_names "${CMAKE_MATCH_1}")
+    endif()
+  endforeach()
+  list(REMOVE_DUPLICATES _kov_names)
+  list(SORT _kov_names)
+  set(_kov_text "/* Generated by cmake/SqliteAmalgamation.cmake: the library's SQLite under names of\n   its own, so that it never meets another SQLite in the same program. */\n")
+  string(APPEND _kov_text "#ifndef KOVPAGER_SQLITE3_NAMES_H\n#define KOVPAGER_SQLITE3_NAMES_H\n")
+  foreach(_name IN LISTS _kov_names)
+    string(APPEND _kov_text "#define ${_name} kovpager_${_name}\n")
+  endforeach()
+  string(APPEND _kov_text "#endif\n")
+  file(WRITE "${_kov_names_header}" "${_kov_text}")
+endif()
+
+# SQLite's compile-time options, chosen for one private connection to one
+# temporary database that is used from one thread at a time. The figures are
+# in bench/RESULTS.md ("SQLite's compile-time options").
+set(KOVPAGER_SQLITE_OPTIONS
+  # No mutexes: the store allows one thread at a time, and the engine is
+  # opened under the pager's one-time construction. Measured faster.
+  SQLITE_THREADSAFE=0
+  # No allocation statistics: every allocation skips a counter update.
+  # Measured faster.
+  SQLITE_DEFAULT_MEMSTATUS=0
+  # SQLITE_SECURE_DELETE is left off (Debian's own library turns it on): freed
+  # pages of a file that nobody else can read need not be zeroed.
+  # Measured faster on drops and replacements.
+  #
+  # The temporary database lives in a file, never in memory: the store exists
+  # for data larger than memory. (1 is SQLite's default; written down so that
+  # nobody changes it by accident.)
+  SQLITE_TEMP_STORE=1
+  # The one connection never shares its cache: no table locks to check.
+  SQLITE_OMIT_SHARED_CACHE
+  # No journal and no write-ahead log: the database is never committed.
+  SQLITE_OMIT_WAL
+  # Nothing is loaded into the private SQLite: no dlopen, no -ldl.
+  SQLITE_OMIT_LOAD_EXTENSION
+  # Interfaces the library never calls.
+  SQLITE_OMIT_DEPRECATED
+  SQLITE_OMIT_PROGRESS_CALLBACK)
+
+add_library(kovpager_sqlite_api INTERFACE)
+target_include_directories(kovpager_sqlite_api SYSTEM INTERFACE
+  "${KOVPAGER_SQLITE_GENERATED}" "${KOVPAGER_SQLITE_DIR}")

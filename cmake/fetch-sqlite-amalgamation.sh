@@ -1,6 +1,8 @@
 #!/bin/sh
 # Makes SQLite's amalgamation (sqlite3.c, sqlite3.h, sqlite3ext.h) from
-# Debian's sqlite3 source package, for the Windows build.
+# Debian's sqlite3 source package: the library's private SQLite, compiled
+# into it on every platform. The first configure of a checkout runs it for
+# third_party/sqlite (cmake/SqliteAmalgamation.cmake).
 #
 #   fetch-sqlite-amalgamation.sh DIR
 #

@@ -14,7 +14,8 @@ WINDOWS_CMAKE_ARGS ?=
 
 # mingw-w64 (POSIX threads) for the cross build; wine64 to run its programs;
 # dpkg-dev (apt-get source) and tcl (tclsh) to make the SQLite amalgamation
-# from Debian's sources, with the host compiler; googletest for the GoogleTest
+# from Debian's sources, with the host compiler (shared with the Linux
+# builds, in third_party/sqlite); googletest for the GoogleTest
 # sources that are cross-built; util-linux for flock.
 WINDOWS_PACKAGES = cmake make gcc g++-mingw-w64-x86-64-posix wine64 dpkg-dev tcl \
                    googletest util-linux
@@ -24,10 +25,11 @@ WINDOWS_PACKAGES = cmake make gcc g++-mingw-w64-x86-64-posix wine64 dpkg-dev tcl
 deps-windows:
 	@sh cmake/install-deps.sh $(WINDOWS_PACKAGES)
 
-# Made by the build as well; done here first so that the step that may need
-# root and the network shows up on its own.
+# Made by the first configure as well, once per checkout and shared with the
+# Linux builds; done here first so that the step that may need root and the
+# network shows up on its own.
 sqlite-windows: deps-windows
-	sh cmake/fetch-sqlite-amalgamation.sh $(WINDOWS_BUILD)/sqlite-amalgamation
+	sh cmake/fetch-sqlite-amalgamation.sh third_party/sqlite
 
 configure-windows: deps-windows sqlite-windows
 	cmake -S . -B $(WINDOWS_BUILD) \

@@ -1,83 +1,61 @@
-// The B-tree operations over one private SQLite connection.
+// The B-tree operations on one connection of the library's private SQLite.
 //
-// How the operations map onto SQL:
+// How the operations map onto SQLite:
 //
-//  * A table is an SQL table named "t<N>" (N counts up per engine, so a name
-//    is never reused): integer keys are `(k INTEGER PRIMARY KEY, v BLOB)`, a
-//    rowid table; byte-string keys with data are `(k BLOB PRIMARY KEY, v
-//    BLOB) WITHOUT ROWID`; key-only entries are `(k BLOB PRIMARY KEY)
-//    WITHOUT ROWID`. Keys are always bound as BLOBs (an empty key as a
-//    zero-length blob, never NULL), so SQLite's own blob order (memcmp over
-//    the shorter length, then the shorter first) is the key order. A table is
-//    named by its root page in sqlite_master.
+//  * The connection is opened on an empty file name (a private temporary
+//    database: the file is made when the cache first spills, unlinked at once
+//    on POSIX, removed on close). Its settings (journal, locking, page and
+//    cache sizes) are made with pragmas and the transaction is begun with
+//    BEGIN, so that the connection itself knows it is inside a transaction
+//    and never commits it. Everything after that goes to SQLite's B-tree
+//    layer through engine/sqlite_btree.h: a table is a B-tree named by its
+//    root page, a cursor is a B-tree cursor, a walk is Next/Previous, a seek
+//    is one search, an insert is one B-tree insert.
 //
-//  * A cursor is on an entry exactly when `row` points at one of its
-//    statements that has just returned SQLITE_ROW; the entry's key and data
-//    are that statement's columns, read in place. Four statements serve a
-//    cursor: forward from a key (>=), forward after a key (>), backward
-//    before a key (<) and backward from the end. Next and Previous step the
-//    statement that is already running in their direction, so walking never
-//    searches again; only a change of direction starts the other statement
-//    at the current key. A cursor's statements come from its table's pool
-//    and go back to it when the cursor closes, so opening and closing a
-//    cursor (which the store does around every table creation) prepares
-//    nothing.
-//
-//  * The engine's bookkeeping reproduces the refusals the store relies on,
+//  * The binding's bookkeeping reproduces the refusals the store relies on,
 //    before SQLite is asked anything: create and drop while cursors are open,
 //    writers against read cursors, inserts through read cursors, reads past
-//    the entry, a null key on a byte-string table.
+//    the entry, a null key on a byte-string table, and every write once a
+//    failure has ended the write transaction. SQLite's B-tree layer itself
+//    checks none of these (it asserts them in debug builds).
+//
+//  * The binding decides for itself whether a cursor is on an entry
+//    (BtCursor::onEntry). After an insert its cursor reports no entry, as the
+//    rules say, while SQLite's cursor is left where the insert put it: the
+//    next insert through it then often needs no search from the root.
 //
 // Invariants:
 //  1. Every open cursor is on its table's list and counted in
 //     Btree::openCursors; a read cursor is counted in Table::readCursors.
-//  2. A cursor's `row` is null or one of the statements of its own set, and
-//     that statement is the only one of the set not in its reset state.
-//  3. No statement is running during CreateTable, DropTable, an insert into
-//     the cursor's table, or Close (all cursors on the table are left first).
-//  4. An inert cursor (engine closed) has bt == table == set == null and
-//     row == null; it is freed only by sqlite3BtreeCloseCursor.
-//  5. While `row` is set, the cursor's key and data fields describe its
-//     current row; while it is null, the lengths are 0.
+//  2. A cursor with onEntry set has an SQLite cursor on an entry of its table
+//     (kovsq_valid), and `entry` describes that entry while `described` is set.
+//  3. No cursor but the inserting one stands on an entry of a table while
+//     SQLite inserts into it (they are all taken off it first).
+//  4. An inert cursor (engine closed) has bt == table == cursor == null and
+//     onEntry false; it is freed only by sqlite3BtreeCloseCursor.
+//  5. Btree::writable is false from the first failure SQLite reports until
+//     the engine is closed; every write checks it first.
 
 #include "engine/btree.h"
 
-#include <sqlite3.h>
-
-#include <climits>
 #include <cstring>
 #include <memory>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
+// After engine/btree.h: its result codes share SQLite's macro names.
+#include "engine/private_sqlite3.h"
+#include "engine/sqlite_btree.h"
+
 namespace kov::engine {
 
 namespace {
 
-enum StatementKind : int {
-    kForwardFrom = 0,     // WHERE k >= ?1 ORDER BY k
-    kForwardAfter = 1,    // WHERE k > ?1 ORDER BY k
-    kBackwardBefore = 2,  // WHERE k < ?1 ORDER BY k DESC
-    kBackwardAll = 3,     // ORDER BY k DESC
-    kStatementKinds = 4,
-};
-
-constexpr int kKeyColumn = 0;
-constexpr int kDataColumn = 1;
+// Keys and data beyond SQLite's default length limit are refused.
+constexpr std::int64_t kMaxLength = 1000000000;
 
 enum class Transaction { None, Read, Write };
-
-struct StatementSet {
-    sqlite3_stmt* stmt[kStatementKinds] = {};
-
-    StatementSet() = default;
-    StatementSet(const StatementSet&) = delete;
-    StatementSet& operator=(const StatementSet&) = delete;
-    ~StatementSet() {
-        for (sqlite3_stmt* s : stmt) sqlite3_finalize(s);
-    }
-};
 
 }  // namespace
 
@@ -85,42 +63,30 @@ struct Table {
     std::uint32_t root = 0;
     bool intKey = false;
     bool hasData = true;
-    std::string name;
-    sqlite3_stmt* insert = nullptr;                   // prepared on first insert
-    std::vector<std::unique_ptr<StatementSet>> spare;  // sets of closed cursors
-    BtCursor* cursors = nullptr;                       // open cursors, a list
+    BtCursor* cursors = nullptr;  // open cursors, a list
     int readCursors = 0;
-
-    Table() = default;
-    Table(const Table&) = delete;
-    Table& operator=(const Table&) = delete;
-    ~Table() { sqlite3_finalize(insert); }
 };
 
 struct Btree {
     sqlite3* db = nullptr;
+    KovsqTree* tree = nullptr;
     std::unordered_map<std::uint32_t, std::unique_ptr<Table>> tables;
     int openCursors = 0;
     Transaction transaction = Transaction::None;
+    bool writable = true;  // false once a failure ended the write transaction
+    int failureCode = SQLITE_OK;  // SQLite's extended code of that failure
     bool pageSizeFixed = false;
-    std::uint64_t nextTableId = 1;
-    sqlite3_stmt* rootOf = nullptr;  // SELECT rootpage ... WHERE name = ?1
 };
 
 struct BtCursor {
     Btree* bt = nullptr;
     Table* table = nullptr;
+    KovsqCursor* cursor = nullptr;
     bool write = false;
-    std::unique_ptr<StatementSet> set;
-    sqlite3_stmt* row = nullptr;
-    int rowKind = -1;
-    // The current entry, read once when the cursor steps onto it; the
-    // pointers are SQLite's own and stay valid until `row` steps or resets.
-    std::int64_t intKey = 0;
-    const unsigned char* key = nullptr;
-    std::uint64_t keyLen = 0;
-    const unsigned char* data = nullptr;
-    std::uint64_t dataLen = 0;
+    bool onEntry = false;
+    bool described = false;
+    KovsqEntry entry{};
+    std::string keyCopy;  // a key that does not lie whole on its page
     BtCursor* prev = nullptr;  // neighbours on the table's list
     BtCursor* next = nullptr;
 };
@@ -129,165 +95,81 @@ namespace {
 
 int exec(sqlite3* db, const char* sql) { return sqlite3_exec(db, sql, nullptr, nullptr, nullptr); }
 
-// After a failed statement SQLite may have rolled the transaction back on
-// its own; keep the bookkeeping true to what the connection says.
-void noteFailure(Btree* bt) {
-    if (bt->db != nullptr && sqlite3_get_autocommit(bt->db) != 0) {
-        bt->transaction = Transaction::None;
-    }
+bool isFailure(int rc) { return rc != SQLITE_OK && rc != SQLITE_DONE; }
+
+// A failure reported by SQLite ends the write transaction for good: with no
+// journal, nothing undoes what a failed write may have left half-done. The
+// binding answers with the primary result code (SQLITE_IOERR for every kind
+// of I/O error); the first extended code is kept.
+int noteFailure(Btree* bt, int rc) {
+    if (!isFailure(rc))
+        return rc;
+    if (bt->writable)
+        bt->failureCode = rc;
+    bt->writable = false;
+    return rc & 0xff;
 }
 
-std::string selectSql(const Table& t, int kind) {
-    std::string sql = t.hasData ? "SELECT k, v FROM " : "SELECT k FROM ";
-    sql += t.name;
-    switch (kind) {
-        case kForwardFrom:
-            sql += " WHERE k >= ?1 ORDER BY k";
-            break;
-        case kForwardAfter:
-            sql += " WHERE k > ?1 ORDER BY k";
-            break;
-        case kBackwardBefore:
-            sql += " WHERE k < ?1 ORDER BY k DESC";
-            break;
-        default:
-            sql += " ORDER BY k DESC";
-            break;
-    }
-    return sql;
+void leaveEntry(BtCursor* cur) {
+    cur->onEntry = false;
+    cur->described = false;
 }
 
-int prepare(sqlite3* db, const std::string& sql, sqlite3_stmt** out) {
-    return sqlite3_prepare_v3(db, sql.c_str(), static_cast<int>(sql.size() + 1),
-                              SQLITE_PREPARE_PERSISTENT, out, nullptr);
+// The cursor after a move that returned `rc`: on an entry exactly when the
+// move succeeded and SQLite's cursor stands on one. A failed move leaves the
+// cursor on no entry.
+int afterMove(BtCursor* cur, int rc) {
+    cur->described = false;
+    if (isFailure(rc)) {
+        kovsq_clear(cur->cursor);
+        cur->onEntry = false;
+        return noteFailure(cur->bt, rc);
+    }
+    cur->onEntry = kovsq_valid(cur->cursor) != 0;
+    return rc;
 }
 
-// The cursor's statement of the given kind, prepared on first use.
-int statement(BtCursor* cur, int kind, sqlite3_stmt** out) {
-    sqlite3_stmt*& s = cur->set->stmt[kind];
-    if (s == nullptr) {
-        int rc = prepare(cur->bt->db, selectSql(*cur->table, kind), &s);
-        if (rc != SQLITE_OK) {
-            s = nullptr;
-            return rc;
-        }
-    }
-    *out = s;
+// The current entry, described once per position.
+int describe(BtCursor* cur) {
+    if (cur->described)
+        return SQLITE_OK;
+    int rc = kovsq_entry(cur->cursor, &cur->entry);
+    if (rc != SQLITE_OK)
+        return noteFailure(cur->bt, rc);
+    cur->described = true;
     return SQLITE_OK;
 }
 
-// Binds n bytes as a blob. A zero-length key is a zero-length blob, never
-// NULL (SQLite binds NULL for a null pointer).
-int bindBytes(sqlite3_stmt* s, int index, const void* p, std::uint64_t n) {
-    if (n == 0) return sqlite3_bind_zeroblob(s, index, 0);
-    return sqlite3_bind_blob64(s, index, p, n, SQLITE_STATIC);
-}
-
-int bindKey(const BtCursor* cur, sqlite3_stmt* s, const void* pKey, std::int64_t nKey) {
-    if (cur->table->intKey) return sqlite3_bind_int64(s, 1, nKey);
-    return bindBytes(s, 1, pKey, static_cast<std::uint64_t>(nKey));
-}
-
-// Binds the key of the entry the cursor stands on (copied: the statement
-// that holds it is about to be reset).
-int bindCurrentKey(const BtCursor* cur, sqlite3_stmt* s) {
-    if (cur->table->intKey) return sqlite3_bind_int64(s, 1, cur->intKey);
-    if (cur->keyLen == 0) return sqlite3_bind_zeroblob(s, 1, 0);
-    return sqlite3_bind_blob64(s, 1, cur->key, cur->keyLen, SQLITE_TRANSIENT);
-}
-
-void clearEntry(BtCursor* cur) {
-    cur->row = nullptr;
-    cur->rowKind = -1;
-    cur->intKey = 0;
-    cur->key = cur->data = nullptr;
-    cur->keyLen = cur->dataLen = 0;
-}
-
-// Takes the cursor off its entry: the running statement is reset.
-void leave(BtCursor* cur) {
-    if (cur->row != nullptr) {
-        sqlite3_reset(cur->row);
-        clearEntry(cur);
+// Lengths of the current entry's key (0 on integer-keyed tables) and data;
+// both 0 on no entry or when the entry cannot be read.
+void entryLengths(BtCursor* cur, std::uint64_t* keyLen, std::uint64_t* dataLen) {
+    *keyLen = 0;
+    *dataLen = 0;
+    if (cur->onEntry && describe(cur) == SQLITE_OK) {
+        *keyLen = cur->entry.keySize;
+        *dataLen = cur->entry.dataSize;
     }
 }
 
-// Reads the entry `s` has just stepped onto (blob pointer first, then its
-// length, as SQLite asks).
-void enter(BtCursor* cur, sqlite3_stmt* s, int kind) {
-    cur->row = s;
-    cur->rowKind = kind;
-    if (cur->table->intKey) {
-        cur->intKey = sqlite3_column_int64(s, kKeyColumn);
-    } else {
-        cur->key = static_cast<const unsigned char*>(sqlite3_column_blob(s, kKeyColumn));
-        cur->keyLen = static_cast<std::uint64_t>(sqlite3_column_bytes(s, kKeyColumn));
-    }
-    if (cur->table->hasData) {
-        cur->data = static_cast<const unsigned char*>(sqlite3_column_blob(s, kDataColumn));
-        cur->dataLen = static_cast<std::uint64_t>(sqlite3_column_bytes(s, kDataColumn));
-    }
-}
-
-// Steps `s`; on a row the cursor stands on it. Returns SQLITE_ROW,
-// SQLITE_DONE (cursor on no entry) or an error (cursor on no entry).
-int stepOnto(BtCursor* cur, sqlite3_stmt* s, int kind) {
-    int rc = sqlite3_step(s);
-    if (rc == SQLITE_ROW) {
-        enter(cur, s, kind);
-        return rc;
-    }
-    sqlite3_reset(s);
-    clearEntry(cur);
-    if (rc != SQLITE_DONE) noteFailure(cur->bt);
-    return rc;
-}
-
-// Starts the statement of `kind` (bound by `bind`, or unbound) and steps
-// onto its first row. The cursor's current statement is left first, after
-// binding, so a bind may copy the current key.
-template <typename Bind>
-int start(BtCursor* cur, int kind, Bind bind) {
-    sqlite3_stmt* s = nullptr;
-    int rc = statement(cur, kind, &s);
-    // A running statement cannot be bound again: leave it first. (A bind that
-    // copies the current key always targets a statement of the other
-    // direction, never the running one.)
-    if (s != nullptr && s == cur->row) leave(cur);
-    if (rc == SQLITE_OK) rc = bind(s);
-    leave(cur);
-    if (rc != SQLITE_OK) {
-        if (s != nullptr) sqlite3_reset(s);
-        return rc;
-    }
-    return stepOnto(cur, s, kind);
-}
-
-int noBind(sqlite3_stmt*) { return SQLITE_OK; }
-
-bool isForward(int kind) { return kind == kForwardFrom || kind == kForwardAfter; }
-
-// Result of a step that moved onto an entry or found none: SQLITE_OK with
-// the flag, or the step's error with the flag unwritten.
-int moveResult(int rc, int* pRes) {
-    if (rc == SQLITE_ROW) {
-        *pRes = 0;
+// Copies payload bytes [offset, offset+amt) of the current entry: from the
+// page when they lie on it, else through SQLite (overflow pages).
+int copyPayload(BtCursor* cur, std::uint32_t offset, std::uint32_t amt, void* out) {
+    if (std::uint64_t{offset} + amt <= cur->entry.localSize) {
+        std::memcpy(out, cur->entry.local + offset, amt);
         return SQLITE_OK;
     }
-    if (rc == SQLITE_DONE) {
-        *pRes = 1;
-        return SQLITE_OK;
-    }
-    return rc;
+    return noteFailure(cur->bt, kovsq_read(cur->cursor, offset, amt, out));
 }
 
 void link(BtCursor* cur) {
     Table* t = cur->table;
     cur->prev = nullptr;
     cur->next = t->cursors;
-    if (t->cursors != nullptr) t->cursors->prev = cur;
+    if (t->cursors != nullptr)
+        t->cursors->prev = cur;
     t->cursors = cur;
-    if (!cur->write) ++t->readCursors;
+    if (!cur->write)
+        ++t->readCursors;
     ++cur->bt->openCursors;
 }
 
@@ -298,60 +180,54 @@ void unlink(BtCursor* cur) {
     } else {
         t->cursors = cur->next;
     }
-    if (cur->next != nullptr) cur->next->prev = cur->prev;
+    if (cur->next != nullptr)
+        cur->next->prev = cur->prev;
     cur->prev = cur->next = nullptr;
-    if (!cur->write) --t->readCursors;
+    if (!cur->write)
+        --t->readCursors;
     --cur->bt->openCursors;
 }
 
-// The cursor's key and data as one run of bytes: the span [offset,
-// offset+amt), which the caller has checked lies within them, is copied
-// from the key, then the data.
-void copyPayload(const BtCursor* cur, std::uint64_t offset, std::uint64_t amt, unsigned char* out) {
-    if (offset < cur->keyLen) {
-        std::uint64_t n = cur->keyLen - offset < amt ? cur->keyLen - offset : amt;
-        std::memcpy(out, cur->key + offset, n);
-        out += n;
-        amt -= n;
-        offset = cur->keyLen;
-    }
-    if (amt > 0) std::memcpy(out, cur->data + (offset - cur->keyLen), amt);
+// The refusals of a byte-string key (rules 2 and 6).
+int checkByteKey(const void* pKey, std::int64_t nKey) {
+    if (pKey == nullptr)
+        return SQLITE_CORRUPT;
+    if (nKey < 0)
+        return SQLITE_ERROR;
+    if (nKey > kMaxLength)
+        return SQLITE_TOOBIG;
+    return SQLITE_OK;
 }
 
 bool validPageSize(int size) { return size >= 512 && size <= 32768 && (size & (size - 1)) == 0; }
 
 }  // namespace
 
-char*& temporaryDirectorySetting() { return sqlite3_temp_directory; }
+char*& temporaryDirectorySetting() { return *kovsq_temp_directory(); }
 
 sqlite3* TEST_connection(Btree* p) { return p == nullptr ? nullptr : p->db; }
 
 int sqlite3BtreeOpen(const char* filename, sqlite3* db, Btree** ppBtree, int flags) {
-    if (ppBtree == nullptr) return SQLITE_MISUSE;
+    if (ppBtree == nullptr)
+        return SQLITE_MISUSE;
     *ppBtree = nullptr;
-    if (filename != nullptr || db != nullptr) return SQLITE_MISUSE;
+    if (filename != nullptr || db != nullptr)
+        return SQLITE_MISUSE;
 
     auto bt = std::make_unique<Btree>();
-    // An empty name asks SQLite for a private temporary database on disk: the
-    // file is made when the cache first spills, unlinked at once on POSIX, and
-    // removed on close. One thread at a time uses it, so no mutex.
-    int rc = sqlite3_open_v2("", &bt->db,
-                             SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE | SQLITE_OPEN_NOMUTEX |
-                                 SQLITE_OPEN_PRIVATECACHE,
-                             nullptr);
-    if (rc == SQLITE_OK && (flags & BTREE_OMIT_JOURNAL) != 0) {
+    int rc = sqlite3_open_v2("", &bt->db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
+    if (rc == SQLITE_OK && (flags & BTREE_OMIT_JOURNAL) != 0)
         rc = exec(bt->db, "PRAGMA journal_mode=OFF");
-    }
-    if (rc == SQLITE_OK && (flags & BTREE_NO_READLOCK) != 0) {
+    if (rc == SQLITE_OK && (flags & BTREE_NO_READLOCK) != 0)
         rc = exec(bt->db, "PRAGMA locking_mode=EXCLUSIVE");
-    }
-    if (rc == SQLITE_OK) rc = exec(bt->db, "PRAGMA synchronous=OFF");
+    if (rc == SQLITE_OK)
+        rc = exec(bt->db, "PRAGMA synchronous=OFF");
     if (rc == SQLITE_OK) {
-        rc = prepare(bt->db, "SELECT rootpage FROM sqlite_master WHERE type='table' AND name=?1",
-                     &bt->rootOf);
+        bt->tree = kovsq_tree_open(bt->db);
+        if (bt->tree == nullptr)
+            rc = SQLITE_NOMEM;
     }
     if (rc != SQLITE_OK) {
-        sqlite3_finalize(bt->rootOf);
         sqlite3_close(bt->db);
         return rc;
     }
@@ -360,61 +236,77 @@ int sqlite3BtreeOpen(const char* filename, sqlite3* db, Btree** ppBtree, int fla
 }
 
 int sqlite3BtreeClose(Btree* p) {
-    if (p == nullptr) return SQLITE_MISUSE;
+    if (p == nullptr)
+        return SQLITE_MISUSE;
     for (auto& entry : p->tables) {
         Table* t = entry.second.get();
         for (BtCursor* cur = t->cursors; cur != nullptr;) {
             BtCursor* following = cur->next;
-            leave(cur);
-            cur->set.reset();
+            kovsq_cursor_close(cur->cursor);
+            cur->cursor = nullptr;
             cur->bt = nullptr;
             cur->table = nullptr;
             cur->prev = cur->next = nullptr;
+            leaveEntry(cur);
             cur = following;
         }
         t->cursors = nullptr;
     }
-    p->tables.clear();  // finalizes every table's statements
-    sqlite3_finalize(p->rootOf);
-    // Anything still prepared on the connection would keep it open.
-    while (sqlite3_stmt* s = sqlite3_next_stmt(p->db, nullptr)) sqlite3_finalize(s);
+    p->tables.clear();
+    kovsq_tree_close(p->tree);
+    // A statement left prepared (by a test's pragma) would keep the connection open.
+    while (sqlite3_stmt* s = sqlite3_next_stmt(p->db, nullptr))
+        sqlite3_finalize(s);
     int rc = sqlite3_close(p->db);
     delete p;
     return rc;
 }
 
 int sqlite3BtreeSetCacheSize(Btree* p, int pages) {
-    if (p == nullptr) return SQLITE_MISUSE;
-    if (pages < 10) pages = 10;
+    if (p == nullptr)
+        return SQLITE_MISUSE;
+    if (pages < 10)
+        pages = 10;
     std::string sql = "PRAGMA cache_size=" + std::to_string(pages);
     return exec(p->db, sql.c_str());
 }
 
 int sqlite3BtreeSetPageSize(Btree* p, int pageSize, int reserve) {
-    if (p == nullptr) return SQLITE_MISUSE;
-    if (p->pageSizeFixed) return SQLITE_READONLY;
-    if (!validPageSize(pageSize) || reserve > 255) return SQLITE_ERROR;
+    if (p == nullptr)
+        return SQLITE_MISUSE;
+    if (p->pageSizeFixed)
+        return SQLITE_READONLY;
+    if (!validPageSize(pageSize) || reserve > 255)
+        return SQLITE_ERROR;
     std::string sql = "PRAGMA page_size=" + std::to_string(pageSize);
     int rc = exec(p->db, sql.c_str());
-    if (rc == SQLITE_OK && reserve >= 0) {
+    if (rc == SQLITE_OK && reserve >= 0)
         rc = sqlite3_file_control(p->db, "main", SQLITE_FCNTL_RESERVE_BYTES, &reserve);
-    }
     return rc;
 }
 
 int sqlite3BtreeBeginTrans(Btree* p, int wrflag) {
-    if (p == nullptr) return SQLITE_MISUSE;
-    if (p->transaction == Transaction::Write) return SQLITE_OK;
+    if (p == nullptr)
+        return SQLITE_MISUSE;
+    if (!p->writable)
+        return SQLITE_ERROR;
+    if (p->transaction == Transaction::Write)
+        return SQLITE_OK;
     if (wrflag == 0) {
-        if (p->transaction == Transaction::Read) return SQLITE_OK;
+        if (p->transaction == Transaction::Read)
+            return SQLITE_OK;
+        // BEGIN alone takes no lock; the read transaction of the B-tree layer
+        // starts with the first read.
         int rc = exec(p->db, "BEGIN DEFERRED");
-        if (rc == SQLITE_OK) p->transaction = Transaction::Read;
+        if (rc == SQLITE_OK)
+            p->transaction = Transaction::Read;
         return rc;
     }
     if (p->transaction == Transaction::Read) {
         // A read transaction has changed nothing; end it and start the write.
         int rc = exec(p->db, "COMMIT");
-        if (rc != SQLITE_OK) return rc;
+        if (rc != SQLITE_OK)
+            return rc;
         p->transaction = Transaction::None;
     }
     int rc = exec(p->db, wrflag > 1 ? "BEGIN EXCLUSIVE" : "BEGIN IMMEDIATE");
@@ -425,62 +317,69 @@ int sqlite3BtreeBeginTrans(Btree* p, int wrflag) {
     return rc;
 }
 
+int sqlite3BtreeTxnState(Btree* p) {
+    if (p == nullptr || p->transaction == Transaction::None)
+        return SQLITE_TXN_NONE;
+    return p->transaction == Transaction::Write && p->writable ? SQLITE_TXN_WRITE : SQLITE_TXN_READ;
+}
+
+int sqlite3BtreeIntegrityCheck(Btree* p, int maxErrors, int* pnErr, std::string* report) {
+    if (p == nullptr || pnErr == nullptr || report == nullptr)
+        return SQLITE_MISUSE;
+    report->clear();
+    *pnErr = 0;
+    if (p->transaction != Transaction::Write)
+        return SQLITE_OK;  // nothing was ever written
+    std::vector<std::uint32_t> roots;
+    roots.reserve(p->tables.size());
+    for (const auto& entry : p->tables)
+        roots.push_back(entry.first);
+    char* text = nullptr;
+    int n = kovsq_integrity_check(p->tree, roots.data(), static_cast<int>(roots.size()),
+                                  maxErrors < 1 ? 1 : maxErrors, &text);
+    if (n < 0)
+        return SQLITE_NOMEM;
+    *pnErr = n;
+    if (text != nullptr)
+        report->assign(text);
+    kovsq_free(text);
+    return SQLITE_OK;
+}
+
 int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags) {
-    if (p == nullptr || piTable == nullptr) return SQLITE_MISUSE;
-    if (p->openCursors > 0) return SQLITE_LOCKED;
-    if (p->transaction != Transaction::Write) return SQLITE_ERROR;
+    if (p == nullptr || piTable == nullptr)
+        return SQLITE_MISUSE;
+    if (p->openCursors > 0)
+        return SQLITE_LOCKED;
+    if (p->transaction != Transaction::Write || !p->writable)
+        return SQLITE_ERROR;
 
     auto t = std::make_unique<Table>();
     t->intKey = (flags & BTREE_INTKEY) != 0;
     t->hasData = (flags & BTREE_ZERODATA) == 0;
-    t->name = "t" + std::to_string(p->nextTableId);
-    std::string sql = "CREATE TABLE " + t->name;
-    if (t->intKey) {
-        sql += t->hasData ? " (k INTEGER PRIMARY KEY, v BLOB)" : " (k INTEGER PRIMARY KEY)";
-    } else {
-        sql += t->hasData ? " (k BLOB PRIMARY KEY, v BLOB) WITHOUT ROWID"
-                          : " (k BLOB PRIMARY KEY) WITHOUT ROWID";
-    }
-    int rc = exec(p->db, sql.c_str());
-    if (rc != SQLITE_OK) {
-        noteFailure(p);
-        return rc;
-    }
-    ++p->nextTableId;
-    p->pageSizeFixed = true;
-
-    sqlite3_bind_text(p->rootOf, 1, t->name.c_str(), static_cast<int>(t->name.size()),
-                      SQLITE_STATIC);
-    rc = sqlite3_step(p->rootOf);
-    std::int64_t root = rc == SQLITE_ROW ? sqlite3_column_int64(p->rootOf, 0) : 0;
-    sqlite3_reset(p->rootOf);
-    if (rc != SQLITE_ROW || root <= 0 || root > UINT32_MAX) {
-        return rc == SQLITE_ROW || rc == SQLITE_DONE ? SQLITE_CORRUPT : rc;
-    }
-    t->root = static_cast<std::uint32_t>(root);
-    p->tables[t->root] = std::move(t);
-    *piTable = static_cast<std::uint32_t>(root);
+    std::uint32_t root = 0;
+    int rc = kovsq_create_table(p->tree, &root, t->intKey ? 1 : 0);
+    if (rc != SQLITE_OK)
+        return noteFailure(p, rc);
+    t->root = root;
+    p->tables[root] = std::move(t);
+    *piTable = root;
     return SQLITE_OK;
 }
 
 int sqlite3BtreeDropTable(Btree* p, std::uint32_t iTable, int* piMoved) {
-    if (p == nullptr || piMoved == nullptr) return SQLITE_MISUSE;
-    if (p->openCursors > 0) return SQLITE_LOCKED;
-    if (p->transaction != Transaction::Write) return SQLITE_ERROR;
+    if (p == nullptr || piMoved == nullptr)
+        return SQLITE_MISUSE;
+    if (p->openCursors > 0)
+        return SQLITE_LOCKED;
+    if (p->transaction != Transaction::Write || !p->writable)
+        return SQLITE_ERROR;
     auto found = p->tables.find(iTable);
-    if (found == p->tables.end()) return SQLITE_ERROR;
-
-    Table* t = found->second.get();
-    // The table's statements would hold its schema entry; finalize them first.
-    sqlite3_finalize(t->insert);
-    t->insert = nullptr;
-    t->spare.clear();
-    std::string sql = "DROP TABLE " + t->name;
-    int rc = exec(p->db, sql.c_str());
-    if (rc != SQLITE_OK) {
-        noteFailure(p);
-        return rc;
-    }
+    if (found == p->tables.end())
+        return SQLITE_ERROR;
+    int rc = kovsq_drop_table(p->tree, iTable);
+    if (rc != SQLITE_OK)
+        return noteFailure(p, rc);  // the table stays known: its root page still exists
     p->tables.erase(found);
     *piMoved = 0;
     return SQLITE_OK;
@@ -489,199 +388,261 @@ int sqlite3BtreeDropTable(Btree* p, std::uint32_t iTable, int* piMoved) {
 int sqlite3BtreeCursor(Btree* p, std::uint32_t iTable, int wrFlag, BtreeCompare xCmp, void* pArg,
                        BtCursor** ppCur) {
     (void)pArg;
-    if (p == nullptr || ppCur == nullptr) return SQLITE_MISUSE;
+    if (p == nullptr || ppCur == nullptr)
+        return SQLITE_MISUSE;
     *ppCur = nullptr;
-    if (xCmp != nullptr) return SQLITE_MISUSE;
+    if (xCmp != nullptr)
+        return SQLITE_MISUSE;
     auto found = p->tables.find(iTable);
-    if (found == p->tables.end()) return SQLITE_ERROR;
+    if (found == p->tables.end())
+        return SQLITE_ERROR;
     Table* t = found->second.get();
-    if (wrFlag != 0 && t->readCursors > 0) return SQLITE_LOCKED;
+    if (wrFlag != 0 && t->readCursors > 0)
+        return SQLITE_LOCKED;
 
     auto cur = std::make_unique<BtCursor>();
+    // Tables exist only inside the write transaction; SQLite's writing
+    // cursors need it to be still open (it always is: nothing ends it).
+    int rc = kovsq_cursor_open(p->tree, iTable, t->intKey ? 1 : 0, wrFlag != 0 ? 1 : 0,
+                               &cur->cursor);
+    if (rc != SQLITE_OK)
+        return noteFailure(p, rc);
     cur->bt = p;
     cur->table = t;
     cur->write = wrFlag != 0;
-    if (!t->spare.empty()) {
-        cur->set = std::move(t->spare.back());
-        t->spare.pop_back();
-    } else {
-        cur->set = std::make_unique<StatementSet>();
-    }
     link(cur.get());
     *ppCur = cur.release();
     return SQLITE_OK;
 }
 
 int sqlite3BtreeCloseCursor(BtCursor* pCur) {
-    if (pCur == nullptr) return SQLITE_MISUSE;
+    if (pCur == nullptr)
+        return SQLITE_MISUSE;
     if (pCur->bt != nullptr) {
-        leave(pCur);
         unlink(pCur);
-        pCur->table->spare.push_back(std::move(pCur->set));
+        kovsq_cursor_close(pCur->cursor);
     }
     delete pCur;
     return SQLITE_OK;
 }
 
-int sqlite3BtreeFirst(BtCursor* pCur, int* pRes) {
-    if (pCur == nullptr || pRes == nullptr) return SQLITE_MISUSE;
-    if (pCur->bt == nullptr) return moveResult(SQLITE_DONE, pRes);
-    int rc = start(pCur, kForwardFrom, [pCur](sqlite3_stmt* s) {
-        return pCur->table->intKey ? sqlite3_bind_int64(s, 1, INT64_MIN)
-                                   : sqlite3_bind_zeroblob(s, 1, 0);
-    });
-    return moveResult(rc, pRes);
+namespace {
+
+// First and Last: flag 1 only for an empty table.
+template <typename Move>
+int moveToEnd(BtCursor* pCur, int* pRes, Move move) {
+    if (pCur == nullptr || pRes == nullptr)
+        return SQLITE_MISUSE;
+    if (pCur->bt == nullptr) {
+        *pRes = 1;
+        return SQLITE_OK;
+    }
+    int empty = 1;
+    int rc = afterMove(pCur, move(pCur->cursor, &empty));
+    if (rc != SQLITE_OK)
+        return rc;
+    *pRes = pCur->onEntry ? 0 : 1;
+    return SQLITE_OK;
 }
 
-int sqlite3BtreeLast(BtCursor* pCur, int* pRes) {
-    if (pCur == nullptr || pRes == nullptr) return SQLITE_MISUSE;
-    if (pCur->bt == nullptr) return moveResult(SQLITE_DONE, pRes);
-    return moveResult(start(pCur, kBackwardAll, noBind), pRes);
+// Next and Previous: flag 1 when there was no such entry, or the cursor was
+// on none.
+template <typename Step>
+int step(BtCursor* pCur, int* pRes, Step stepOnce) {
+    if (pCur == nullptr || pRes == nullptr)
+        return SQLITE_MISUSE;
+    if (!pCur->onEntry) {
+        *pRes = 1;
+        return SQLITE_OK;
+    }
+    int rc = afterMove(pCur, stepOnce(pCur->cursor));
+    if (isFailure(rc))
+        return rc;
+    *pRes = pCur->onEntry ? 0 : 1;
+    return SQLITE_OK;
 }
 
-int sqlite3BtreeNext(BtCursor* pCur, int* pRes) {
-    if (pCur == nullptr || pRes == nullptr) return SQLITE_MISUSE;
-    if (pCur->row == nullptr) return moveResult(SQLITE_DONE, pRes);
-    if (isForward(pCur->rowKind)) return moveResult(stepOnto(pCur, pCur->row, pCur->rowKind), pRes);
-    int rc = start(pCur, kForwardAfter, [pCur](sqlite3_stmt* s) { return bindCurrentKey(pCur, s); });
-    return moveResult(rc, pRes);
-}
+}  // namespace
 
-int sqlite3BtreePrevious(BtCursor* pCur, int* pRes) {
-    if (pCur == nullptr || pRes == nullptr) return SQLITE_MISUSE;
-    if (pCur->row == nullptr) return moveResult(SQLITE_DONE, pRes);
-    if (!isForward(pCur->rowKind)) return moveResult(stepOnto(pCur, pCur->row, pCur->rowKind), pRes);
-    int rc =
-        start(pCur, kBackwardBefore, [pCur](sqlite3_stmt* s) { return bindCurrentKey(pCur, s); });
-    return moveResult(rc, pRes);
-}
+int sqlite3BtreeFirst(BtCursor* pCur, int* pRes) { return moveToEnd(pCur, pRes, kovsq_first); }
+
+int sqlite3BtreeLast(BtCursor* pCur, int* pRes) { return moveToEnd(pCur, pRes, kovsq_last); }
+
+int sqlite3BtreeNext(BtCursor* pCur, int* pRes) { return step(pCur, pRes, kovsq_next); }
+
+int sqlite3BtreePrevious(BtCursor* pCur, int* pRes) { return step(pCur, pRes, kovsq_previous); }
 
 int sqlite3BtreeEof(BtCursor* pCur) {
-    if (pCur == nullptr) return SQLITE_MISUSE;  // nonzero: not on an entry
-    return pCur->row == nullptr ? 1 : 0;
+    if (pCur == nullptr)
+        return SQLITE_MISUSE;  // nonzero: not on an entry
+    return pCur->onEntry ? 0 : 1;
 }
 
 int sqlite3BtreeMoveto(BtCursor* pCur, const void* pKey, std::int64_t nKey, int* pRes) {
-    if (pCur == nullptr || pRes == nullptr) return SQLITE_MISUSE;
+    if (pCur == nullptr || pRes == nullptr)
+        return SQLITE_MISUSE;
     if (pCur->bt == nullptr) {
         *pRes = -1;
         return SQLITE_OK;
     }
     if (!pCur->table->intKey) {
-        if (pKey == nullptr) return SQLITE_CORRUPT;
-        if (nKey < 0) return SQLITE_ERROR;
+        int refused = checkByteKey(pKey, nKey);
+        if (refused != SQLITE_OK)
+            return refused;
     }
-    // Land on the smallest entry not below the key; when there is none, on
-    // the largest entry below it.
-    int rc = start(pCur, kForwardFrom,
-                   [pCur, pKey, nKey](sqlite3_stmt* s) { return bindKey(pCur, s, pKey, nKey); });
-    if (rc == SQLITE_ROW) {
-        bool equal;
-        if (pCur->table->intKey) {
-            equal = pCur->intKey == nKey;
-        } else {
-            equal = pCur->keyLen == static_cast<std::uint64_t>(nKey) &&
-                    (nKey == 0 || std::memcmp(pCur->key, pKey, pCur->keyLen) == 0);
-        }
-        *pRes = equal ? 0 : 1;
+    int cmp = 0;
+    int rc = pCur->table->intKey
+                 ? kovsq_seek_int(pCur->cursor, nKey, &cmp)
+                 : kovsq_seek_key(pCur->cursor, pKey, static_cast<std::uint32_t>(nKey), &cmp);
+    rc = afterMove(pCur, rc);
+    if (rc != SQLITE_OK)
+        return rc;
+    if (!pCur->onEntry) {
+        *pRes = -1;  // an empty table
         return SQLITE_OK;
     }
-    if (rc != SQLITE_DONE) return rc;
-    rc = start(pCur, kBackwardBefore,
-               [pCur, pKey, nKey](sqlite3_stmt* s) { return bindKey(pCur, s, pKey, nKey); });
-    if (rc != SQLITE_ROW && rc != SQLITE_DONE) return rc;
-    *pRes = -1;
+    if (cmp < 0) {
+        // SQLite stopped on the smaller neighbour: land on the larger one
+        // when there is one, else come back to the last entry.
+        rc = afterMove(pCur, kovsq_next(pCur->cursor));
+        if (isFailure(rc))
+            return rc;
+        if (pCur->onEntry) {
+            cmp = 1;
+        } else {
+            int empty = 1;
+            rc = afterMove(pCur, kovsq_last(pCur->cursor, &empty));
+            if (rc != SQLITE_OK)
+                return rc;
+        }
+    }
+    *pRes = cmp;
     return SQLITE_OK;
 }
 
 int sqlite3BtreeKeySize(BtCursor* pCur, std::int64_t* pSize) {
-    if (pCur == nullptr || pSize == nullptr) return SQLITE_MISUSE;
-    // Both fields read 0 on no entry.
-    *pSize = pCur->table != nullptr && pCur->table->intKey ? pCur->intKey
-                                                            : static_cast<std::int64_t>(pCur->keyLen);
+    if (pCur == nullptr || pSize == nullptr)
+        return SQLITE_MISUSE;
+    if (!pCur->onEntry) {
+        *pSize = 0;
+        return SQLITE_OK;
+    }
+    int rc = describe(pCur);
+    if (rc != SQLITE_OK)
+        return rc;
+    *pSize = pCur->table->intKey ? pCur->entry.intKey
+                                 : static_cast<std::int64_t>(pCur->entry.keySize);
     return SQLITE_OK;
 }
 
 int sqlite3BtreeKey(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, void* pBuf) {
-    if (pCur == nullptr) return SQLITE_MISUSE;
-    if (pCur->table != nullptr && pCur->table->intKey) return SQLITE_CORRUPT;
-    if (std::uint64_t{offset} + amt > pCur->keyLen + pCur->dataLen) return SQLITE_ERROR;
-    if (amt == 0) return SQLITE_OK;
-    if (pBuf == nullptr) return SQLITE_MISUSE;
-    copyPayload(pCur, offset, amt, static_cast<unsigned char*>(pBuf));
-    return SQLITE_OK;
+    if (pCur == nullptr)
+        return SQLITE_MISUSE;
+    if (pCur->table != nullptr && pCur->table->intKey)
+        return SQLITE_CORRUPT;
+    std::uint64_t keyLen = 0;
+    std::uint64_t dataLen = 0;
+    entryLengths(pCur, &keyLen, &dataLen);
+    if (std::uint64_t{offset} + amt > keyLen + dataLen)
+        return SQLITE_ERROR;
+    if (amt == 0)
+        return SQLITE_OK;
+    if (pBuf == nullptr)
+        return SQLITE_MISUSE;
+    return copyPayload(pCur, pCur->entry.keyOffset + offset, amt, pBuf);
 }
 
 const void* sqlite3BtreeKeyFetch(BtCursor* pCur, std::uint32_t* pAmt) {
-    if (pCur == nullptr || pAmt == nullptr) return nullptr;
-    if (pCur->row == nullptr || pCur->table->intKey || pCur->keyLen > UINT32_MAX) {
-        *pAmt = 0;
+    if (pCur == nullptr || pAmt == nullptr)
         return nullptr;
+    *pAmt = 0;
+    if (!pCur->onEntry || pCur->table->intKey || describe(pCur) != SQLITE_OK)
+        return nullptr;
+    const KovsqEntry& e = pCur->entry;
+    const unsigned char* key = e.local + e.keyOffset;
+    if (std::uint64_t{e.keyOffset} + e.keySize > e.localSize) {
+        // The key runs onto overflow pages: lend a copy instead.
+        pCur->keyCopy.resize(e.keySize);
+        if (copyPayload(pCur, e.keyOffset, e.keySize, pCur->keyCopy.data()) != SQLITE_OK)
+            return nullptr;
+        key = reinterpret_cast<const unsigned char*>(pCur->keyCopy.data());
     }
-    *pAmt = static_cast<std::uint32_t>(pCur->keyLen);
-    // SQLite hands out no pointer for an empty blob; the key is then empty.
-    static const unsigned char kEmpty = 0;
-    return pCur->key != nullptr ? pCur->key : &kEmpty;
+    *pAmt = e.keySize;
+    return key;
 }
 
 int sqlite3BtreeDataSize(BtCursor* pCur, std::uint32_t* pSize) {
-    if (pCur == nullptr || pSize == nullptr) return SQLITE_MISUSE;
-    *pSize = static_cast<std::uint32_t>(pCur->dataLen);
+    if (pCur == nullptr || pSize == nullptr)
+        return SQLITE_MISUSE;
+    if (!pCur->onEntry) {
+        *pSize = 0;
+        return SQLITE_OK;
+    }
+    int rc = describe(pCur);
+    if (rc != SQLITE_OK)
+        return rc;
+    *pSize = pCur->entry.dataSize;
     return SQLITE_OK;
 }
 
 int sqlite3BtreeData(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, void* pBuf) {
-    if (pCur == nullptr) return SQLITE_MISUSE;
-    if (std::uint64_t{offset} + amt > pCur->dataLen) return SQLITE_ERROR;
-    if (amt == 0) return SQLITE_OK;
-    if (pBuf == nullptr) return SQLITE_MISUSE;
-    std::memcpy(pBuf, pCur->data + offset, amt);
-    return SQLITE_OK;
+    if (pCur == nullptr)
+        return SQLITE_MISUSE;
+    std::uint64_t keyLen = 0;
+    std::uint64_t dataLen = 0;
+    entryLengths(pCur, &keyLen, &dataLen);
+    if (std::uint64_t{offset} + amt > dataLen)
+        return SQLITE_ERROR;
+    if (amt == 0)
+        return SQLITE_OK;
+    if (pBuf == nullptr)
+        return SQLITE_MISUSE;
+    return copyPayload(pCur, pCur->entry.keyOffset + pCur->entry.keySize + offset, amt, pBuf);
 }
 
 int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, const void* pData,
                        int nData) {
-    if (pCur == nullptr || pCur->bt == nullptr) return SQLITE_MISUSE;
+    if (pCur == nullptr || pCur->bt == nullptr)
+        return SQLITE_MISUSE;
     Btree* bt = pCur->bt;
     Table* t = pCur->table;
-    if (bt->transaction != Transaction::Write) return SQLITE_ERROR;
-    if (!pCur->write) return SQLITE_PERM;
-    if (t->readCursors > 0) return SQLITE_LOCKED;
+    if (bt->transaction != Transaction::Write || !bt->writable)
+        return SQLITE_ERROR;
+    if (!pCur->write)
+        return SQLITE_PERM;
+    if (t->readCursors > 0)
+        return SQLITE_LOCKED;
     if (!t->intKey) {
-        if (pKey == nullptr) return SQLITE_CORRUPT;
-        if (nKey < 0) return SQLITE_ERROR;
+        int refused = checkByteKey(pKey, nKey);
+        if (refused != SQLITE_OK)
+            return refused;
     }
-    if (nData < 0) return SQLITE_ERROR;
-    if (pData == nullptr && nData > 0) return SQLITE_MISUSE;
+    if (nData < 0)
+        return SQLITE_ERROR;
+    if (nData > kMaxLength)
+        return SQLITE_TOOBIG;
+    if (pData == nullptr && nData > 0)
+        return SQLITE_MISUSE;
+    const std::uint32_t dataSize = t->hasData ? static_cast<std::uint32_t>(nData) : 0;
 
-    if (t->insert == nullptr) {
-        std::string sql;
-        if (t->hasData) {
-            sql = "INSERT OR REPLACE INTO " + t->name + " (k, v) VALUES (?1, ?2)";
-        } else {
-            // An equal key is the same entry: nothing to replace.
-            sql = "INSERT OR IGNORE INTO " + t->name + " (k) VALUES (?1)";
-        }
-        int rc = prepare(bt->db, sql, &t->insert);
-        if (rc != SQLITE_OK) {
-            t->insert = nullptr;
-            return rc;
-        }
+    // Every cursor on the table leaves its entry: their positions are
+    // unspecified afterwards, and SQLite would otherwise save each one's key.
+    for (BtCursor* c = t->cursors; c != nullptr; c = c->next) {
+        if (c != pCur)
+            kovsq_clear(c->cursor);
+        leaveEntry(c);
     }
-    sqlite3_stmt* s = t->insert;
-    int rc = bindKey(pCur, s, pKey, nKey);
-    if (rc == SQLITE_OK && t->hasData) rc = bindBytes(s, 2, pData, static_cast<std::uint64_t>(nData));
-    if (rc != SQLITE_OK) return rc;
-
-    // Every cursor on the table leaves its entry: none may be reading the
-    // table while it changes, and their positions are unspecified afterwards.
-    for (BtCursor* c = t->cursors; c != nullptr; c = c->next) leave(c);
-
-    rc = sqlite3_step(s);
-    sqlite3_reset(s);
-    if (rc == SQLITE_DONE) return SQLITE_OK;
-    noteFailure(bt);
-    return rc;
+    int rc;
+    if (t->intKey) {
+        rc = kovsq_insert_int(pCur->cursor, nKey, pData, dataSize);
+    } else {
+        // SQLite's record keeps the empty key and empty data as fields of
+        // length 0; a null pointer is never handed on.
+        static const unsigned char kNothing = 0;
+        rc = kovsq_insert_key(pCur->cursor, pKey, static_cast<std::uint32_t>(nKey),
+                              pData != nullptr ? pData : &kNothing, dataSize, t->hasData ? 1 : 0);
+    }
+    return noteFailure(bt, rc);
 }
 
 }  // namespace kov::engine

@@ -1,6 +1,7 @@
 // The storage engine binding: the ordered B-tree operations the store is
-// built on, implemented over SQLite's public C API on one private
-// connection.
+// built on, implemented on SQLite's B-tree layer: one connection of the
+// library's private SQLite holds one temporary database, whose tables are
+// SQLite B-trees (engine/sqlite_btree.h says how entries are laid out).
 //
 // What this layer promises (each rule has its own test in
 // tests/engine_test.cpp):
@@ -44,8 +45,8 @@
 //
 // Handles. Every operation tolerates a null engine or cursor handle: it
 // returns SQLITE_MISUSE and writes no out-value (for sqlite3BtreeEof that
-// nonzero answer also means "not on an entry"). Closing the engine finalizes all of its statements and leaves each
-// of its cursors as an inert object that answers like a cursor on an empty
+// nonzero answer also means "not on an entry"). Closing the engine closes
+// its SQLite cursors and leaves each of its cursor handles as an inert object that answers like a cursor on an empty
 // table (moves report no entry, sizes are 0, reads past nothing are
 // refused, inserts are refused with SQLITE_MISUSE) until it is itself
 // closed with sqlite3BtreeCloseCursor, which frees it. So a cursor handle
@@ -57,11 +58,12 @@
 //
 // Refusals leave every state as it was. Failures reported by SQLite itself
 // (I/O errors, a full disk, out of memory) are returned as its result code;
-// a cursor whose step failed is left on no entry. When such a failure made
-// SQLite end the write transaction, every later insert, table creation and
-// drop is refused with SQLITE_ERROR until the engine is closed: with no
-// journal SQLite's rollback undoes nothing, and writes on top of what it
-// left could silently damage entries that still read back whole.
+// a cursor whose step failed is left on no entry. After any such failure
+// the write transaction counts as ended (sqlite3BtreeTxnState): every later
+// insert, table creation and drop, and BeginTrans, is refused with
+// SQLITE_ERROR until the engine is closed. There is no journal, so nothing
+// can undo an insert that failed half-way, and writes on top of what it left
+// could silently damage entries that still read back whole.
 // docs/faults.md says what stays readable after each kind of fault.
 #ifndef KOVPAGER_ENGINE_BTREE_H
 #define KOVPAGER_ENGINE_BTREE_H
@@ -69,6 +71,7 @@
 // Include this header before <sqlite3.h> where both are needed: the result
 // codes below share SQLite's macro names and values.
 #include <cstdint>
+#include <string>
 
 struct sqlite3;
 
@@ -101,6 +104,13 @@ enum : int {
     BTREE_LEAFDATA = 4,
 };
 
+// Transaction states of sqlite3BtreeTxnState.
+enum : int {
+    SQLITE_TXN_NONE = 0,
+    SQLITE_TXN_READ = 1,
+    SQLITE_TXN_WRITE = 2,
+};
+
 // Open flags for sqlite3BtreeOpen.
 enum : int {
     BTREE_OMIT_JOURNAL = 1,
@@ -124,8 +134,7 @@ char*& temporaryDirectorySetting();
 // *ppBtree, or null on failure.
 int sqlite3BtreeOpen(const char* filename, sqlite3* db, Btree** ppBtree, int flags);
 
-// Closes the engine: every statement is finalized, the transaction is
-// discarded, the temporary file is deleted, and every cursor still open
+// Closes the engine: the transaction is discarded, the temporary file is deleted, and every cursor still open
 // becomes inert (see above). The handle is freed.
 int sqlite3BtreeClose(Btree* p);
 
@@ -138,7 +147,21 @@ int sqlite3BtreeSetPageSize(Btree* p, int pageSize, int reserve);
 
 // Begins a transaction: write flag 0 = read, 1 = write, above 1 = write
 // with the exclusive lock taken at once. Never committed by the store.
+// Refused with SQLITE_ERROR once a failure has ended the write transaction.
 int sqlite3BtreeBeginTrans(Btree* p, int wrflag);
+
+// SQLITE_TXN_WRITE while writes are accepted, SQLITE_TXN_READ for a read
+// transaction and for a write transaction that a failure ended (reads go
+// on, writes are refused), SQLITE_TXN_NONE before any transaction. A null
+// handle answers SQLITE_TXN_NONE.
+int sqlite3BtreeTxnState(Btree* p);
+
+// SQLite's own integrity check of the whole database file: every table of
+// the engine (dropped ones excepted), the free-page list, and that every
+// page belongs to one of them. Writes the number of problems found to *pnErr
+// and, when there are any, SQLite's description of at most maxErrors of them
+// to *report (cleared otherwise). SQLITE_NOMEM when the check could not run.
+int sqlite3BtreeIntegrityCheck(Btree* p, int maxErrors, int* pnErr, std::string* report);
 
 // Creates an empty table with the given flags and writes its root page.
 int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags);

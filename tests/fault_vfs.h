@@ -43,7 +43,7 @@
 #ifndef KOVPAGER_TESTS_FAULT_VFS_H
 #define KOVPAGER_TESTS_FAULT_VFS_H
 
-#include <sqlite3.h>
+#include "engine/private_sqlite3.h"
 
 #include <cstdint>
 

@@ -17,7 +17,7 @@
 #include "engine/btree.h"
 #include "model_store_util.h"
 // After the engine binding's header, which shares SQLite's result-code names.
-#include <sqlite3.h>
+#include "engine/private_sqlite3.h"
 
 using namespace kovtest;
 

@@ -12,7 +12,7 @@
 
 #include "engine/btree.h"  // before <sqlite3.h>: they share the result-code names
 
-#include <sqlite3.h>
+#include "engine/private_sqlite3.h"
 
 #include "model_store_util.h"
 #include "tempdir/TempDirectory.h"

@@ -25,12 +25,12 @@
 // is set from what the engine holds (resync): every model table is read back through the engine,
 // compared with the model (the comparison is recorded in faultReport()), and taken as the truth;
 // every live slot takes its handle and position from the store. When every table reads back
-// without error and the engine's consistency check (PRAGMA quick_check) passes, everything is
+// without error and SQLite's integrity check of the whole database passes, everything is
 // checked strictly again, and so it is when only the consistency check fails while the engine
 // refuses writes (nothing can change then). Otherwise (a damaged database) what the engine
 // answers is not defined: the program goes on unchecked ("degraded": no crash and no hang is all
-// that is asked) until a reset opens a fresh engine. When the fault made SQLite end the write
-// transaction, the engine refuses every later write until it is closed, silently at the store's
+// that is asked) until a reset opens a fresh engine. A fault ends the engine's write
+// transaction: it refuses every later write until it is closed, silently at the store's
 // interface: the model then takes every insert as a no-op, every table creation as a table on root
 // page 0 (no cursor opens on it) and every table destruction as refused, until a reset opens a
 // fresh engine.
@@ -56,9 +56,6 @@
 
 #include "engine/btree.h"
 #include "kov_test_access.h"
-// After the engine binding's header, which shares SQLite's result-code names (this file spells
-// no result code by name).
-#include <sqlite3.h>
 
 namespace kovtest {
 
@@ -198,8 +195,8 @@ class StoreProgram {
     std::uint64_t operations() const { return operations_; }
     // Answers that differ from the model.
     std::uint64_t mismatches() const { return mismatches_; }
-    // True once a fault made SQLite end the write transaction: the engine refuses writes until a
-    // reset opens a fresh one.
+    // True once a fault ended the engine's write transaction: it refuses writes until a reset
+    // opens a fresh one.
     bool writesRefused() const { return writesRefused_; }
     const std::vector<std::string>& mismatchTexts() const { return texts_; }
     std::string firstMismatch() const { return texts_.empty() ? std::string() : texts_.front(); }
@@ -319,7 +316,8 @@ class StoreProgram {
         }
         if (faulted) {
             if (engineOpen_ && KovTestAccess::engine() != nullptr &&
-                sqlite3_get_autocommit(kov::engine::TEST_connection(KovTestAccess::engine())) != 0)
+                kov::engine::sqlite3BtreeTxnState(KovTestAccess::engine()) !=
+                    kov::engine::SQLITE_TXN_WRITE)
                 writesRefused_ = true;
             if (lastInsertRoot_ != 0)
                 refused_.push_back({lastInsertRoot_, lastInsertKey_});
@@ -1074,8 +1072,8 @@ class StoreProgram {
 
     // Reads one table back through the engine and makes it the model's; `classify` adds the
     // comparison with the model to the report.
-    // The engine's result codes used here (SQLite's values; <sqlite3.h> defines the names as
-    // macros, so they are not spelled out).
+    // The engine's result codes used here (SQLite's values; <sqlite3.h>, which a program may
+    // include after this header, defines the names as macros, so they are not spelled out).
     static constexpr int kEngineOk = 0;
     static constexpr int kEngineCorrupt = 11;
 
@@ -1202,20 +1200,15 @@ class StoreProgram {
         }
     }
 
-    // The engine's own consistency check of the whole database. Any finding counts, even a page
-    // that no table uses: such a page is what an insert that failed half-way leaves, and later
-    // inserts into such a database have been seen to damage tables that read back whole.
+    // SQLite's own integrity check of the whole database. Any finding counts, even a page that no
+    // table uses: such a page is what an insert that failed half-way leaves, and later inserts
+    // into such a database have been seen to damage tables that read back whole.
     static bool databaseSound() {
-        sqlite3* db = kov::engine::TEST_connection(KovTestAccess::engine());
-        sqlite3_stmt* s = nullptr;
-        bool ok = false;
-        if (sqlite3_prepare_v2(db, "PRAGMA quick_check", -1, &s, nullptr) == 0 &&
-            sqlite3_step(s) == 100 /* a row */) {
-            const unsigned char* text = sqlite3_column_text(s, 0);
-            ok = text != nullptr && std::strcmp(reinterpret_cast<const char*>(text), "ok") == 0;
-        }
-        sqlite3_finalize(s);
-        return ok;
+        int problems = 0;
+        std::string report;
+        return kov::engine::sqlite3BtreeIntegrityCheck(KovTestAccess::engine(), 10, &problems,
+                                                       &report) == 0 &&
+               problems == 0;
     }
 
     ChoiceSource& in_;
