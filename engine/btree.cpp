@@ -632,15 +632,16 @@ int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, cons
             kovsq_clear(c->cursor);
         leaveEntry(c);
     }
+    // Empty data is handed on as zero bytes at a real address: SQLite copies
+    // it with memcpy, which must not be given a null pointer.
+    static const unsigned char kNothing = 0;
+    const void* data = pData != nullptr ? pData : &kNothing;
     int rc;
     if (t->intKey) {
-        rc = kovsq_insert_int(pCur->cursor, nKey, pData, dataSize);
+        rc = kovsq_insert_int(pCur->cursor, nKey, data, dataSize);
     } else {
-        // SQLite's record keeps the empty key and empty data as fields of
-        // length 0; a null pointer is never handed on.
-        static const unsigned char kNothing = 0;
-        rc = kovsq_insert_key(pCur->cursor, pKey, static_cast<std::uint32_t>(nKey),
-                              pData != nullptr ? pData : &kNothing, dataSize, t->hasData ? 1 : 0);
+        rc = kovsq_insert_key(pCur->cursor, pKey, static_cast<std::uint32_t>(nKey), data, dataSize,
+                              t->hasData ? 1 : 0);
     }
     return noteFailure(bt, rc);
 }

@@ -1,6 +1,7 @@
 #!/bin/sh
 # Fails when the DLL exports any name that is not a member of KovPager,
-# KovBtree or KovBtreeCursor, or any name of the engine (sqlite3_*).
+# KovBtree or KovBtreeCursor, or any name of the engine (sqlite3_*, the
+# library's renamed kovpager_sqlite3_*, kovsq_*).
 #   tests/check_dll_exports.sh <path to libkovpager.dll> [objdump]
 # objdump defaults to x86_64-w64-mingw32-objdump; the demangler is the
 # c++filt beside it (x86_64-w64-mingw32-c++filt), else the host's c++filt.
@@ -20,7 +21,7 @@ raw=$("$objdump" -p "$dll" | awk '
     inside { exit }')
 [ -n "$raw" ] || { echo "no exported names found in $dll" >&2; exit 1; }
 
-engine=$(printf '%s\n' "$raw" | grep -E '^_?sqlite3' || true)
+engine=$(printf '%s\n' "$raw" | grep -E '^_?(kovpager_)?sqlite3|^_?kovsq_' || true)
 if [ -n "$engine" ]; then
     echo "engine names exported:" >&2
     printf '%s\n' "$engine" >&2

@@ -107,7 +107,8 @@ int loadOnly(const std::string& library) {
     check(GetModuleHandleA(name.c_str()) == module, "GetModuleHandle finds the loaded DLL");
     for (const char* member : {kPagerInstance, kTableConstructor, kCursorInsert})
         check(GetProcAddress(module, member) != nullptr, std::string("export ") + member);
-    check(GetProcAddress(module, "sqlite3_open") == nullptr, "the engine is not exported");
+    for (const char* engine : {"sqlite3_open", "kovpager_sqlite3_open", "kovsq_tree_open"})
+        check(GetProcAddress(module, engine) == nullptr, std::string("not exported: ") + engine);
     check(FreeLibrary(module) != 0, "FreeLibrary succeeds");
     check(!isLoaded(name), name + " unloaded");
     const std::vector<std::string> left = entriesOf(scratchDir());

@@ -217,6 +217,9 @@ TEST(EngineLarge, RunPastTheCacheSpillsIntoTheTemporaryDirectoryAndReadsBack) {
         EXPECT_LT(seekInt(r.get(), kRecords), 0);
         EXPECT_EQ(currentIntKey(r.get()), kRecords - 1);
 
+        // SQLite's own check of every page of the file.
+        EXPECT_EQ(integrityProblems(engine.get()), "");
+
         ASSERT_EQ(r.close(), SQLITE_OK);
         EXPECT_EQ(engine.close(), SQLITE_OK);
     }

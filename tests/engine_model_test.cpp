@@ -66,10 +66,7 @@ class EngineModelRun {
             oneStep();
         for (auto& c : cursors_)
             c.reset();
-        int problems = -1;
-        std::string report;
-        ASSERT_EQ(sqlite3BtreeIntegrityCheck(engine_.get(), 10, &problems, &report), SQLITE_OK);
-        EXPECT_EQ(problems, 0) << where() << report;
+        EXPECT_EQ(integrityProblems(engine_.get()), "") << where();
         for (int t = 0; t < kTables; ++t)
             expectTableMatches(t);
     }

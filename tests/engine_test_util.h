@@ -175,6 +175,19 @@ inline std::vector<std::pair<std::int64_t, std::string>> walkInts(BtCursor* cur)
     return out;
 }
 
+// SQLite's integrity check of the whole database behind an engine: empty when
+// it finds nothing, else what it found (or why it could not run).
+inline std::string integrityProblems(Btree* engine) {
+    int problems = 0;
+    std::string report;
+    int rc = sqlite3BtreeIntegrityCheck(engine, 20, &problems, &report);
+    if (rc != SQLITE_OK)
+        return "the integrity check could not run: result code " + std::to_string(rc);
+    if (problems == 0)
+        return {};
+    return std::to_string(problems) + " problem(s): " + report;
+}
+
 // A string of `n` bytes that differ from position to position, seeded so
 // that different seeds give different bytes.
 inline std::string patternBytes(std::size_t n, unsigned seed) {

@@ -15,9 +15,17 @@
 #include <kovpager/KovBtreeCursor.h>
 #include <kovpager/KovPager.h>
 
+#include "engine_test_util.h"
 #include "kov_test_access.h"
 
 namespace kovtest {
+
+// SQLite's integrity check of the store's whole database: empty when it finds nothing (or when
+// the engine is closed), else what it found.
+inline std::string storeIntegrityProblems() {
+    kov::engine::Btree* engine = KovTestAccess::engine();
+    return engine == nullptr ? std::string() : kov::engine::test::integrityProblems(engine);
+}
 
 constexpr std::uint32_t kFreeSlot = 0xFFFFFFFFu;
 

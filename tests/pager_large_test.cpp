@@ -78,4 +78,5 @@ TEST(PagerLarge, TenTimesTheCacheComesBackIntact) {
         reader.data(got.data(), got.size());
         ASSERT_TRUE(got == expected.of(k)) << "record " << k << " differs";
     }
+    EXPECT_EQ(storeIntegrityProblems(), "");
 }

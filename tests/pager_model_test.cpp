@@ -6,7 +6,8 @@
 // step by step, against an in-memory model of what the store must do (StoreProgram, in
 // store_program.h, which the fault test, the fuzz target and the soak program share). After every
 // step the registry, the engine handle and every live cursor's position are compared with the
-// model; every answer that differs is a mismatch.
+// model; every answer that differs is a mismatch. After each program SQLite's own integrity check
+// goes over the whole database.
 //
 // The model keeps the engine's view: a map from root page to table contents, and one record per
 // registry slot with the state of its engine cursor (none, open, or inert after reset), whether
@@ -22,6 +23,7 @@
 #include <cstdlib>
 #include <string>
 
+#include "model_store_util.h"
 #include "store_program.h"
 
 namespace {
@@ -44,6 +46,7 @@ void runSeed(std::uint32_t seed) {
     EXPECT_EQ(program.steps(), static_cast<std::uint64_t>(kSteps)) << "seed " << seed;
     EXPECT_FALSE(program.stopped()) << "seed " << seed;
     EXPECT_EQ(program.mismatches(), 0u) << "seed " << seed;
+    EXPECT_EQ(kovtest::storeIntegrityProblems(), "") << "seed " << seed;
     for (const std::string& text : program.mismatchTexts())
         ADD_FAILURE() << "seed " << seed << ": " << text;
 }

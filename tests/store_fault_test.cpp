@@ -5,6 +5,7 @@
 
 #include <string>
 
+#include "model_store_util.h"
 #include "store_program.h"
 #include "store_program_faults.h"
 // after the engine binding's header
@@ -47,6 +48,7 @@ struct Outcome {
     std::string firstMismatch;
     bool fired = false;
     bool degraded = false;
+    std::string integrity;  // SQLite's integrity check right after the run, before the reset
     std::uint64_t calls[kov::test::kFaultKinds] = {};
     std::uint64_t bytes = 0;
 };
@@ -74,6 +76,8 @@ Outcome runWith(std::uint32_t seed, int steps, FaultPlan::Kind kind, std::uint64
     for (int k = 0; k < kov::test::kFaultKinds; ++k)
         out.calls[k] = vfs.faults().calls(static_cast<FaultKind>(k));
     out.bytes = vfs.faults().bytesInUse();
+    if (!armFault)
+        out.integrity = kovtest::storeIntegrityProblems();
     // A fresh engine after reset works as before.
     program.forceReset();
     for (int i = 0; i < 200; ++i)
@@ -133,6 +137,7 @@ TEST(StoreFaults, ProgramPastTheCacheMatchesTheModel) {
     EXPECT_GT(o.calls[static_cast<int>(FaultKind::Write)], 1000u);
     EXPECT_GT(o.calls[static_cast<int>(FaultKind::Read)], 100u);
     EXPECT_GT(o.bytes, 32u * 1024 * 1024);
+    EXPECT_EQ(o.integrity, "");
 }
 
 // A failed read, once or for 40 steps: the operation that met it did nothing (a refused insert
