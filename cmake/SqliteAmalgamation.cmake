@@ -106,6 +106,13 @@ set(KOVPAGER_SQLITE_OPTIONS
   # Interfaces the library never calls.
   SQLITE_OMIT_DEPRECATED
   SQLITE_OMIT_PROGRESS_CALLBACK)
+if(NOT WIN32)
+  # One system call per page read or written past the cache (pread/pwrite)
+  # instead of two (lseek, then read or write): what SQLite's own configure
+  # finds on Linux, and what Debian's library uses. Measured faster past the
+  # cache. (Windows reads and writes at an offset in one call anyway.)
+  list(APPEND KOVPAGER_SQLITE_OPTIONS HAVE_PREAD64=1 HAVE_PWRITE64=1)
+endif()
 
 add_library(kovpager_sqlite_api INTERFACE)
 target_include_directories(kovpager_sqlite_api SYSTEM INTERFACE

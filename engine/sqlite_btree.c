@@ -36,17 +36,17 @@
  *     sqlite3BtreeFirst, sqlite3BtreeLast, sqlite3BtreeNext and
  *     sqlite3BtreePrevious (SQLITE_DONE at either end), sqlite3BtreeEof,
  *     sqlite3BtreeTableMoveto, sqlite3BtreeIndexMoveto, sqlite3BtreeInsert,
- *     sqlite3BtreeIntegerKey, sqlite3BtreePayloadSize,
- *     sqlite3BtreePayloadFetch, sqlite3BtreePayload,
+ *     getCellInfo and BtCursor.info (pPayload, nPayload, nLocal, nKey: the
+ *     parsed current cell), MemPage.aDataEnd, sqlite3BtreePayload,
  *     sqlite3BtreeIntegrityCheck (returns the report, root page 1 included),
  *     sqlite3KeyInfoAlloc, sqlite3KeyInfoUnref, sqlite3VdbeMemInit,
  *     sqlite3PutVarint, sqlite3VarintLen, getVarint32.
  *
  * Behaviour relied on, found by reading 3.40.1 (see also the pitfalls noted
  * at each function):
- *   - sqlite3BtreePayloadFetch does not parse the cell: the cell must have
- *     been parsed since the last move (sqlite3BtreePayloadSize or
- *     sqlite3BtreeIntegerKey do that), or it returns the previous entry.
+ *   - The parsed cell (BtCursor.info) is only valid after getCellInfo since
+ *     the last move (sqlite3BtreePayloadFetch does not parse the cell, and
+ *     hands back the previous entry's payload unless something parsed it).
  *   - An index insert replaces an equal entry only when it searches with the
  *     unpacked key (nMem = 1, the key field); with nMem = 0 it compares whole
  *     records, and an equal key with other data becomes a second entry.
@@ -295,21 +295,25 @@ int kovsq_insert_key(KovsqCursor *cursor, const void *key, uint32_t keySize, con
 
 int kovsq_entry(KovsqCursor *cursor, KovsqEntry *entry) {
     BtCursor *cur = &cursor->cur;
-    u32 size, local, header, keyType, dataType = 12;
     const unsigned char *p;
+    u32 size, local, header, keyType, dataType = 12;
     int at;
 
     if (cur->eState != CURSOR_VALID) return SQLITE_MISUSE;
-    memset(entry, 0, sizeof(*entry));
-    /* Parses the cell first: PayloadFetch alone would describe the entry
-     * parsed last. */
-    size = sqlite3BtreePayloadSize(cur);
-    p = (const unsigned char *)sqlite3BtreePayloadFetch(cur, &local);
+    /* The cell parsed once per position (what sqlite3BtreePayloadSize and
+     * sqlite3BtreePayloadFetch do, without their second look). */
+    getCellInfo(cur);
+    p = cur->info.pPayload;
+    size = cur->info.nPayload;
+    local = cur->info.nLocal;
     if (local > size) local = size;
+    if (p + local > cur->pPage->aDataEnd) return SQLITE_CORRUPT_BKPT;
     entry->local = p;
     entry->localSize = local;
     if (cur->curIntKey) {
-        entry->intKey = sqlite3BtreeIntegerKey(cur);
+        entry->intKey = cur->info.nKey;
+        entry->keyOffset = 0;
+        entry->keySize = 0;
         entry->dataSize = size;
         return SQLITE_OK;
     }
@@ -324,6 +328,7 @@ int kovsq_entry(KovsqCursor *cursor, KovsqEntry *entry) {
     if ((u32)at != header || keyType < 12 || (keyType & 1) != 0 || dataType < 12 ||
         (dataType & 1) != 0)
         return SQLITE_CORRUPT_BKPT;
+    entry->intKey = 0;
     entry->keyOffset = header;
     entry->keySize = (keyType - 12) / 2;
     entry->dataSize = (dataType - 12) / 2;
