@@ -29,7 +29,9 @@
 //
 // Output: one JSON line: processor and elapsed nanoseconds per operation of
 // the measured phase (processor time is that of the whole process, so a
-// backend's own background threads are charged to it), the peak resident
+// backend's own background threads are charged to it), that processor time
+// split into user and kernel time, the read and write system calls per
+// operation and the bytes they moved (/proc/self/io), the peak resident
 // set (getrusage ru_maxrss), the scratch disk in use at the end (allocated
 // bytes of the files under the scratch directory, including the unlinked
 // temporary file SQLite keeps open), and the read tally (rows, sum), which
@@ -75,12 +77,48 @@ using kov::peers::CompositeKeys;
 using kov::peers::RandomKeys;
 using kov::peers::Shuffle;
 
-// A moment on the process's processor clock and on the steady clock.
+// The I/O system calls of this process so far (/proc/self/io; zeros where
+// the system has no such file).
+struct IoCounts {
+    double reads = 0;       // read system calls (syscr)
+    double writes = 0;      // write system calls (syscw)
+    double readBytes = 0;   // bytes they moved (rchar, wchar)
+    double writeBytes = 0;
+    static IoCounts now() {
+        IoCounts c;
+        if (FILE* f = std::fopen("/proc/self/io", "r")) {
+            char name[64];
+            unsigned long long value = 0;
+            while (std::fscanf(f, "%63[^:]: %llu\n", name, &value) == 2) {
+                const std::string field = name;
+                if (field == "syscr") c.reads = static_cast<double>(value);
+                if (field == "syscw") c.writes = static_cast<double>(value);
+                if (field == "rchar") c.readBytes = static_cast<double>(value);
+                if (field == "wchar") c.writeBytes = static_cast<double>(value);
+            }
+            std::fclose(f);
+        }
+        return c;
+    }
+};
+
+// A moment on the process's processor clock (also split into user and
+// kernel time), on the steady clock, and in the process's I/O counts.
 struct Moment {
     double cpu = 0;
     double wall = 0;
+    double user = 0;
+    double sys = 0;
+    IoCounts io;
     static Moment now() {
         Moment m;
+        m.io = IoCounts::now();
+        rusage usage{};
+        getrusage(RUSAGE_SELF, &usage);
+        m.user = static_cast<double>(usage.ru_utime.tv_sec) +
+                 static_cast<double>(usage.ru_utime.tv_usec) * 1e-6;
+        m.sys = static_cast<double>(usage.ru_stime.tv_sec) +
+                static_cast<double>(usage.ru_stime.tv_usec) * 1e-6;
         timespec ts{};
         clock_gettime(CLOCK_PROCESS_CPUTIME_ID, &ts);
         m.cpu = static_cast<double>(ts.tv_sec) + static_cast<double>(ts.tv_nsec) * 1e-9;
@@ -90,15 +128,28 @@ struct Moment {
     }
 };
 
-// Nanoseconds per operation between two moments.
+// Per operation between two moments: nanoseconds, and I/O system calls.
 struct PerOp {
     double cpu = 0;
     double wall = 0;
+    double user = 0;
+    double sys = 0;
+    double reads = 0;
+    double writes = 0;
+    double readBytes = 0;
+    double writeBytes = 0;
     static PerOp of(const Moment& start, const Moment& stop, std::uint64_t ops) {
         PerOp p;
         if (ops > 0) {
-            p.cpu = (stop.cpu - start.cpu) * 1e9 / static_cast<double>(ops);
-            p.wall = (stop.wall - start.wall) * 1e9 / static_cast<double>(ops);
+            const double n = static_cast<double>(ops);
+            p.cpu = (stop.cpu - start.cpu) * 1e9 / n;
+            p.wall = (stop.wall - start.wall) * 1e9 / n;
+            p.user = (stop.user - start.user) * 1e9 / n;
+            p.sys = (stop.sys - start.sys) * 1e9 / n;
+            p.reads = (stop.io.reads - start.io.reads) / n;
+            p.writes = (stop.io.writes - start.io.writes) / n;
+            p.readBytes = (stop.io.readBytes - start.io.readBytes) / n;
+            p.writeBytes = (stop.io.writeBytes - start.io.writeBytes) / n;
         }
         return p;
     }
@@ -384,11 +435,15 @@ int main(int argc, char** argv) {
         std::printf(
             "{\"backend\":\"%s\",\"workload\":\"%s\",\"n\":%llu,\"ops\":%llu,"
             "\"ns_cpu\":%.1f,\"ns_wall\":%.1f,\"fill_ns_cpu\":%.1f,\"fill_ns_wall\":%.1f,"
+            "\"ns_user\":%.1f,\"ns_sys\":%.1f,\"reads_per_op\":%.3f,\"writes_per_op\":%.3f,"
+            "\"read_bytes_per_op\":%.0f,\"write_bytes_per_op\":%.0f,"
             "\"peak_rss_kib\":%ld,\"disk_bytes\":%llu,\"rows\":%llu,\"sum\":%llu,"
             "\"missing\":%llu}\n",
             backend.c_str(), workload.c_str(), static_cast<unsigned long long>(n),
             static_cast<unsigned long long>(r.ops), r.measured.cpu, r.measured.wall, r.fill.cpu,
-            r.fill.wall, usage.ru_maxrss, static_cast<unsigned long long>(r.diskBytes),
+            r.fill.wall, r.measured.user, r.measured.sys, r.measured.reads, r.measured.writes,
+            r.measured.readBytes, r.measured.writeBytes, usage.ru_maxrss,
+            static_cast<unsigned long long>(r.diskBytes),
             static_cast<unsigned long long>(r.tally.rows),
             static_cast<unsigned long long>(r.tally.sum),
             static_cast<unsigned long long>(r.missing));
