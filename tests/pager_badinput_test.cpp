@@ -366,7 +366,7 @@ TEST_F(StoreTest, AThousandCursorsAcrossAHundredTableCreations) {
 // so neither memory nor the database grows with their number.
 TEST_F(StoreTest, AHundredThousandTablesMadeAndDestroyed) {
     const int count = sanitized() ? 20000 : 100000;
-    // Warm up: the first tables fix the statement caches and the schema's pages.
+    // Warm up: the first tables settle the engine's bookkeeping and the free pages.
     for (int i = 0; i < 1000; ++i)
         KovBtree t(static_cast<KovBtree::TableType>(i % 3));
     const long rssBefore = peakRssKiB();

@@ -1191,7 +1191,7 @@ class StoreProgram {
         }
         degraded_ = anyBroken();
         if (!degraded_ && engineOpen_ && KovTestAccess::engine() != nullptr && !databaseSound()) {
-            // Every table reads back, but the database's own structure is damaged (a statement
+            // Every table reads back, but the database's own structure is damaged (an insert
             // that failed half-way, with no journal to undo it): later writes are not defined.
             // While the engine refuses writes nothing can change what was read back, so every
             // answer is still checked.
