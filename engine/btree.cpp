@@ -75,6 +75,8 @@ struct Btree {
     Transaction transaction = Transaction::None;
     bool writable = true;  // false once a failure ended the write transaction
     int failureCode = SQLITE_OK;  // SQLite's extended code of that failure
+    const char* failureOperation = "";  // what the engine was doing then
+    Btree* nextOpen = nullptr;  // the list of open engines
     bool pageSizeFixed = false;
 };
 
@@ -100,15 +102,28 @@ bool isFailure(int rc) { return rc != SQLITE_OK && rc != SQLITE_DONE; }
 // A failure reported by SQLite ends the write transaction for good: with no
 // journal, nothing undoes what a failed write may have left half-done. The
 // binding answers with the primary result code (SQLITE_IOERR for every kind
-// of I/O error); the first extended code is kept.
-int noteFailure(Btree* bt, int rc) {
+// of I/O error); the first failure's extended code is kept, with what the
+// engine was doing.
+int noteFailure(Btree* bt, int rc, const char* operation) {
     if (!isFailure(rc))
         return rc;
-    if (bt->writable)
+    if (bt->writable) {
         bt->failureCode = rc;
+        bt->failureOperation = operation;
+    }
     bt->writable = false;
     return rc & 0xff;
 }
+
+constexpr const char* kMoving = "moving a cursor";
+constexpr const char* kReading = "reading an entry";
+
+// The engines open now, a list through Btree::nextOpen. A handle can outlive
+// its engine in the hands of a pager copy; this is how the pager tells. A
+// plain pointer, so that it is still there for host objects destroyed at exit
+// after every static object. (One thread at a time, as everywhere in the
+// engine.)
+Btree* gOpenEngines = nullptr;
 
 void leaveEntry(BtCursor* cur) {
     cur->onEntry = false;
@@ -123,7 +138,7 @@ int afterMove(BtCursor* cur, int rc) {
     if (isFailure(rc)) {
         kovsq_clear(cur->cursor);
         cur->onEntry = false;
-        return noteFailure(cur->bt, rc);
+        return noteFailure(cur->bt, rc, kMoving);
     }
     cur->onEntry = kovsq_valid(cur->cursor) != 0;
     return rc;
@@ -135,7 +150,7 @@ int describe(BtCursor* cur) {
         return SQLITE_OK;
     int rc = kovsq_entry(cur->cursor, &cur->entry);
     if (rc != SQLITE_OK)
-        return noteFailure(cur->bt, rc);
+        return noteFailure(cur->bt, rc, kReading);
     cur->described = true;
     return SQLITE_OK;
 }
@@ -158,7 +173,7 @@ int copyPayload(BtCursor* cur, std::uint32_t offset, std::uint32_t amt, void* ou
         std::memcpy(out, cur->entry.local + offset, amt);
         return SQLITE_OK;
     }
-    return noteFailure(cur->bt, kovsq_read(cur->cursor, offset, amt, out));
+    return noteFailure(cur->bt, kovsq_read(cur->cursor, offset, amt, out), kReading);
 }
 
 void link(BtCursor* cur) {
@@ -231,13 +246,39 @@ int sqlite3BtreeOpen(const char* filename, sqlite3* db, Btree** ppBtree, int fla
         sqlite3_close(bt->db);
         return rc;
     }
+    bt->nextOpen = gOpenEngines;
+    gOpenEngines = bt.get();
     *ppBtree = bt.release();
     return SQLITE_OK;
 }
 
+bool sqlite3BtreeIsOpen(Btree* p) {
+    for (Btree* e = gOpenEngines; e != nullptr; e = e->nextOpen) {
+        if (e == p)
+            return p != nullptr;
+    }
+    return false;
+}
+
+int sqlite3BtreeFailure(Btree* p, const char** operation) {
+    if (p == nullptr)
+        return SQLITE_MISUSE;
+    if (operation != nullptr)
+        *operation = p->failureOperation;
+    return p->failureCode;
+}
+
+const char* resultText(int code) { return sqlite3_errstr(code); }
+
 int sqlite3BtreeClose(Btree* p) {
     if (p == nullptr)
         return SQLITE_MISUSE;
+    for (Btree** link = &gOpenEngines; *link != nullptr; link = &(*link)->nextOpen) {
+        if (*link == p) {
+            *link = p->nextOpen;
+            break;
+        }
+    }
     for (auto& entry : p->tables) {
         Table* t = entry.second.get();
         for (BtCursor* cur = t->cursors; cur != nullptr;) {
@@ -360,7 +401,7 @@ int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags) {
     std::uint32_t root = 0;
     int rc = kovsq_create_table(p->tree, &root, t->intKey ? 1 : 0);
     if (rc != SQLITE_OK)
-        return noteFailure(p, rc);
+        return noteFailure(p, rc, "creating a table");
     t->root = root;
     p->tables[root] = std::move(t);
     *piTable = root;
@@ -379,7 +420,7 @@ int sqlite3BtreeDropTable(Btree* p, std::uint32_t iTable, int* piMoved) {
         return SQLITE_ERROR;
     int rc = kovsq_drop_table(p->tree, iTable);
     if (rc != SQLITE_OK)
-        return noteFailure(p, rc);  // the table stays known: its root page still exists
+        return noteFailure(p, rc, "dropping a table");  // its root page still exists
     p->tables.erase(found);
     *piMoved = 0;
     return SQLITE_OK;
@@ -406,7 +447,7 @@ int sqlite3BtreeCursor(Btree* p, std::uint32_t iTable, int wrFlag, BtreeCompare 
     int rc = kovsq_cursor_open(p->tree, iTable, t->intKey ? 1 : 0, wrFlag != 0 ? 1 : 0,
                                &cur->cursor);
     if (rc != SQLITE_OK)
-        return noteFailure(p, rc);
+        return noteFailure(p, rc, "opening a cursor");
     cur->bt = p;
     cur->table = t;
     cur->write = wrFlag != 0;
@@ -520,7 +561,11 @@ int sqlite3BtreeMoveto(BtCursor* pCur, const void* pKey, std::int64_t nKey, int*
     return SQLITE_OK;
 }
 
-int sqlite3BtreeKeySize(BtCursor* pCur, std::int64_t* pSize) {
+namespace {
+
+// KeySize and DataSize: 0 on no entry, else what `of` reads of the entry.
+template <typename Size, typename Of>
+int entrySize(BtCursor* pCur, Size* pSize, Of of) {
     if (pCur == nullptr || pSize == nullptr)
         return SQLITE_MISUSE;
     if (!pCur->onEntry) {
@@ -530,9 +575,16 @@ int sqlite3BtreeKeySize(BtCursor* pCur, std::int64_t* pSize) {
     int rc = describe(pCur);
     if (rc != SQLITE_OK)
         return rc;
-    *pSize = pCur->table->intKey ? pCur->entry.intKey
-                                 : static_cast<std::int64_t>(pCur->entry.keySize);
+    *pSize = of(*pCur);
     return SQLITE_OK;
+}
+
+}  // namespace
+
+int sqlite3BtreeKeySize(BtCursor* pCur, std::int64_t* pSize) {
+    return entrySize(pCur, pSize, [](const BtCursor& c) {
+        return c.table->intKey ? c.entry.intKey : static_cast<std::int64_t>(c.entry.keySize);
+    });
 }
 
 int sqlite3BtreeKey(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, void* pBuf) {
@@ -572,17 +624,7 @@ const void* sqlite3BtreeKeyFetch(BtCursor* pCur, std::uint32_t* pAmt) {
 }
 
 int sqlite3BtreeDataSize(BtCursor* pCur, std::uint32_t* pSize) {
-    if (pCur == nullptr || pSize == nullptr)
-        return SQLITE_MISUSE;
-    if (!pCur->onEntry) {
-        *pSize = 0;
-        return SQLITE_OK;
-    }
-    int rc = describe(pCur);
-    if (rc != SQLITE_OK)
-        return rc;
-    *pSize = pCur->entry.dataSize;
-    return SQLITE_OK;
+    return entrySize(pCur, pSize, [](const BtCursor& c) { return c.entry.dataSize; });
 }
 
 int sqlite3BtreeData(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, void* pBuf) {
@@ -643,7 +685,9 @@ int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, cons
         rc = kovsq_insert_key(pCur->cursor, pKey, static_cast<std::uint32_t>(nKey), data, dataSize,
                               t->hasData ? 1 : 0);
     }
-    return noteFailure(bt, rc);
+    if (isFailure(rc))
+        kovsq_clear(pCur->cursor);  // SQLite may have left it faulted: on no entry, as the others
+    return noteFailure(bt, rc, "inserting an entry");
 }
 
 }  // namespace kov::engine

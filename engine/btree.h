@@ -150,6 +150,23 @@ int sqlite3BtreeSetPageSize(Btree* p, int pageSize, int reserve);
 // Refused with SQLITE_ERROR once a failure has ended the write transaction.
 int sqlite3BtreeBeginTrans(Btree* p, int wrflag);
 
+// The first failure SQLite reported since the engine opened (the one that
+// ended its write transaction): SQLite's extended result code (for example
+// SQLITE_IOERR_WRITE, 778), or SQLITE_OK when there was none. *operation,
+// when not null, receives what the engine was doing then, as a phrase
+// ("inserting an entry", "moving a cursor", "reading an entry", "creating a
+// table", "dropping a table", "opening a cursor"; "" when there was none).
+// SQLITE_MISUSE for a null handle, *operation unwritten.
+int sqlite3BtreeFailure(Btree* p, const char** operation);
+
+// True while `p` is an engine opened by sqlite3BtreeOpen and not yet closed.
+// A handle kept elsewhere (a copy of the pager's) can outlive its engine;
+// this tells, without touching the handle.
+bool sqlite3BtreeIsOpen(Btree* p);
+
+// SQLite's English text for a result code, primary or extended.
+const char* resultText(int code);
+
 // SQLITE_TXN_WRITE while writes are accepted, SQLITE_TXN_READ for a read
 // transaction and for a write transaction that a failure ended (reads go
 // on, writes are refused), SQLITE_TXN_NONE before any transaction. A null

@@ -354,6 +354,13 @@ int main(int argc, char** argv) {
     }
     std::printf("  temporary directory  %s\n",
                 tempDir.empty() ? "(none: the data fit in the page cache)" : tempDir.c_str());
+    // A failure of the store (a full disk, say) shows in the checks above as missing records;
+    // the store says what it was.
+    KovPager* pager = KovPager::instance();
+    if (pager->failed()) {
+        std::printf("FAILED: %s\n", pager->failure().c_str());
+        return 1;
+    }
     if (failures != 0) {
         std::printf("FAILED: %d checks\n", failures);
         return 1;

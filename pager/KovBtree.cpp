@@ -22,7 +22,7 @@ std::uint32_t flagsOf(KovBtree::TableType type) {
 }  // namespace
 
 KovBtree::KovBtree(TableType type) : pager_(KovPager::instance()), rootPage_(0), tableFlags_(0) {
-    if (pager_->engine_ == nullptr)
+    if (pager_->openEngine() == nullptr)
         pager_->initialize();
     tableFlags_ = flagsOf(type);
     rootPage_ = 0;
@@ -35,7 +35,7 @@ KovBtree::KovBtree(TableType type) : pager_(KovPager::instance()), rootPage_(0),
 
 KovBtree::~KovBtree() {
     // Refused by the engine while any cursor is open: the table then stays until the engine closes.
-    if (pager_->engine_ != nullptr) {
+    if (pager_->openEngine() != nullptr) {
         int moved = 0;
         eng::sqlite3BtreeDropTable(pager_->engine_, rootPage_, &moved);
     }

@@ -26,14 +26,14 @@ KovBtreeCursor::KovBtreeCursor(const KovBtree& table, bool write)
     // Built before the append: push_back may move the registry's storage.
     const CursorSlot slot{nullptr, table.rootPage_, table.tableFlags_};
     registry_->push_back(slot);
-    eng::sqlite3BtreeCursor(pager->engine_, table.rootPage_, write ? 1 : 0, nullptr, nullptr,
+    eng::sqlite3BtreeCursor(pager->openEngine(), table.rootPage_, write ? 1 : 0, nullptr, nullptr,
                             &(*registry_)[slotIndex_].cursor);
 }
 
 KovBtreeCursor::~KovBtreeCursor() {
     KovPager* pager = KovPager::instance();
     // With the engine closed (reset, or the exit-time teardown) the slot stays as it is.
-    if (pager->engine_ == nullptr)
+    if (pager->openEngine() == nullptr)
         return;
     std::vector<CursorSlot>& slots = *registry_;
     if (slotIndex_ >= slots.size())

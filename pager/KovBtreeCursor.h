@@ -82,8 +82,11 @@ class KOVPAGER_EXPORT KovBtreeCursor {
 
     // Adds an entry, or replaces the one with an equal key (data included). Afterwards the
     // position of every cursor on the table is unspecified (on no entry, in this store). Adds
-    // nothing through a read cursor or while a read cursor is open on the table. Data longer
-    // than 2^31 - 1 bytes cannot be stored.
+    // nothing through a read cursor or while a read cursor is open on the table.
+    // Sizes: a data size is taken modulo 2^32 (its low 32 bits): 2^32 + 3 stores the first 3
+    // bytes, 2^32 stores empty data. The insert adds nothing when that comes to more than
+    // 1 000 000 000 bytes (2^31 and more included), and nothing for a key longer than
+    // 1 000 000 000 bytes (key sizes are not cut). Neither buffer is read then.
     // REQUIRES: the form matching the table's kind (another form adds nothing).
     // Integer key with data (IntKeyTable):
     void insert(std::int64_t key, const void* data, std::uint64_t size);
@@ -97,9 +100,10 @@ class KOVPAGER_EXPORT KovBtreeCursor {
     // REQUIRES: good(), for a meaningful result.
     void key(std::int64_t& key);
 
-    // Copies the first `size` bytes of the current entry's data into `buffer`. Copies nothing on
-    // no entry or when `size` exceeds dataSize(). The copy is the caller's: nothing a cursor
-    // hands back refers to the store's memory.
+    // Copies the first `size` bytes of the current entry's data into `buffer`. `size` is taken
+    // modulo 2^32 (its low 32 bits): 2^32 + 4 copies 4 bytes, 2^32 copies nothing. Copies
+    // nothing on no entry or when that exceeds dataSize(). The copy is the caller's: nothing a
+    // cursor hands back refers to the store's memory.
     // REQUIRES: `buffer` holds `size` bytes; good(), for a meaningful result.
     void data(void* buffer, std::uint64_t size);
 
@@ -125,8 +129,9 @@ class KOVPAGER_EXPORT KovBtreeCursor {
   private:
     friend struct KovTestAccess;  // the unit tests only; never defined by the library
 
-    // Copies the first `size` bytes of key-then-data of a byte-string entry; nothing on an
-    // integer-keyed table, on no entry, or when `size` exceeds key plus data.
+    // Copies the first `size` bytes (taken modulo 2^32, as for data()) of key-then-data of a
+    // byte-string entry; nothing on an integer-keyed table, on no entry, or when that exceeds
+    // key plus data.
     void key(void* buffer, std::uint64_t size);
 
     // The key's length (the integer key on an IntKeyTable); 0 on no entry.

@@ -74,12 +74,35 @@ class KOVPAGER_EXPORT KovPager {
     // the next table creation frees what such slots still hold. Calling it twice does nothing more.
     void reset();
 
+    // True once the store has lost or refused data through a failure since its engine opened:
+    // the engine could not be opened, the temporary file could not be created, read or written,
+    // the disk was full, memory ran out. Cleared by reset(). The refusals the store makes by
+    // design (an insert through a read cursor, a key of the wrong form, ...) are not failures.
+    // After a failure the store refuses every write until reset(); what reads back stays as it
+    // reads (docs/faults.md says what that is for each kind of failure).
+    bool failed() const;
+
+    // The first such failure as one sentence for a log: what the store was doing, the engine's
+    // message and code, and the temporary directory. Empty while failed() is false. Later
+    // failures do not replace the first.
+    //
+    //   if (KovPager::instance()->failed())
+    //       std::fprintf(stderr, "%s\n", KovPager::instance()->failure().c_str());
+    std::string failure() const;
+
     // Copies share the engine handle without owning it. A copy cannot be destroyed (the
-    // destructor is private); the library never copies the pager.
+    // destructor is private); the library never copies the pager. reset() on a copy closes the
+    // engine it shares, as reset() on the process's pager does.
     KovPager(const KovPager& other);
 
     // Copies the engine handle, the registry and the directory text. When the target is the
-    // process's pager, the engine's directory setting follows the new text.
+    // process's pager, the engine's directory setting follows the new text, and what the copy
+    // holds is checked against what is open now: an engine that has been closed since the copy
+    // was taken is not taken (the store keeps its engine), an engine that no pager holds any
+    // more is closed, a slot whose engine cursor has been closed since gets none (its cursor
+    // then answers as on no entry), and an engine cursor that no slot names any more is closed.
+    // So no order of calls reaches freed memory; but a copy taken before a table creation or a
+    // cursor's destruction does not bring the cursors back where they were.
     KovPager& operator=(const KovPager& other);
 
   private:
@@ -93,8 +116,16 @@ class KOVPAGER_EXPORT KovPager {
     ~KovPager();
 
     // (Re)opens the engine: closes the current one if any, opens a fresh temporary database, sets
-    // the page and cache sizes and begins the one exclusive write transaction.
+    // the page and cache sizes and begins the one exclusive write transaction. A failure is kept
+    // (failed()).
     void initialize();
+
+    // The engine handle when its engine is open; otherwise (closed through a copy's reset())
+    // null, and engine_ becomes null too.
+    kov::engine::Btree* openEngine();
+
+    // Closes the engine if it is open, and forgets the handle. The one place that closes it.
+    void closeEngine();
 
     // Closes every live cursor, saving its position in `saved` (index-aligned with the registry):
     // 8 native-order bytes of the integer key, or the whole byte-string key.
@@ -110,6 +141,8 @@ class KOVPAGER_EXPORT KovPager {
     kov::engine::Btree* engine_;
     std::vector<CursorSlot> cursorSlots_;
     std::string tempDir_;
+    // SQLite's result code when opening the engine failed since the last reset(), else 0.
+    int openFailure_;
 
     static const std::int64_t defaultPageSize_ = 4096;
     static const std::int64_t defaultCacheSize_ = 16384;

@@ -325,19 +325,28 @@ TEST(EngineModel, CursorTakenOffItsEntryThenInsertingItsOldKey) {
 // A cursor on the last entry of a key-only table inserted a key that belongs on the same page
 // but before the last one: SQLite kept its "on the last entry" mark, and the next Last did not
 // move. The binding drops the mark after every insert.
-TEST(EngineModel, LastAfterAnInsertBeforeTheLastEntryOfItsPage) {
-    TestEngine engine;
-    std::uint32_t root = engine.createTable(kKeyOnlyTable);
-    TestCursor cur(engine.get(), root, 1);
-    // Enough keys for more than one level of pages, so that the last entry is not on the root.
+namespace {
+
+// The keys k0000..k1999 in a key-only table, enough for more than one level of pages (so the
+// last entry is not on the root), and the cursor on the last one.
+void fillAndGoLast(BtCursor* cur) {
     char key[16];
     for (int i = 0; i < 2000; ++i) {
         std::snprintf(key, sizeof key, "k%04d", i);
-        ASSERT_EQ(insertBytes(cur.get(), key), SQLITE_OK);
+        ASSERT_EQ(insertBytes(cur, key), SQLITE_OK);
     }
     int res = 1;
-    ASSERT_EQ(sqlite3BtreeLast(cur.get(), &res), SQLITE_OK);
-    ASSERT_EQ(currentKey(cur.get()), "k1999");
+    ASSERT_EQ(sqlite3BtreeLast(cur, &res), SQLITE_OK);
+    ASSERT_EQ(currentKey(cur), "k1999");
+}
+
+}  // namespace
+
+TEST(EngineModel, LastAfterAnInsertBeforeTheLastEntryOfItsPage) {
+    TestEngine engine;
+    TestCursor cur(engine.get(), engine.createTable(kKeyOnlyTable), 1);
+    fillAndGoLast(cur.get());
+    int res = 1;
     ASSERT_EQ(insertBytes(cur.get(), "k1998a"), SQLITE_OK);
     ASSERT_EQ(sqlite3BtreeLast(cur.get(), &res), SQLITE_OK);
     EXPECT_EQ(res, 0);
@@ -351,16 +360,9 @@ TEST(EngineModel, LastAfterAnInsertBeforeTheLastEntryOfItsPage) {
 // landed, and the next Last did not move.
 TEST(EngineModel, LastAfterASearchThatStartedOnTheLastPage) {
     TestEngine engine;
-    std::uint32_t root = engine.createTable(kKeyOnlyTable);
-    TestCursor cur(engine.get(), root, 1);
-    char key[16];
-    for (int i = 0; i < 2000; ++i) {
-        std::snprintf(key, sizeof key, "k%04d", i);
-        ASSERT_EQ(insertBytes(cur.get(), key), SQLITE_OK);
-    }
+    TestCursor cur(engine.get(), engine.createTable(kKeyOnlyTable), 1);
+    fillAndGoLast(cur.get());
     int res = 1;
-    ASSERT_EQ(sqlite3BtreeLast(cur.get(), &res), SQLITE_OK);
-    ASSERT_EQ(currentKey(cur.get()), "k1999");
     ASSERT_EQ(seekBytes(cur.get(), "k1997"), 0);
     ASSERT_EQ(sqlite3BtreeLast(cur.get(), &res), SQLITE_OK);
     EXPECT_EQ(res, 0);

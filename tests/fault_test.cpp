@@ -300,6 +300,15 @@ void expectWritesRefused(Store& store) {
     EXPECT_FALSE(store.writable());
 }
 
+// The failure the engine kept: its first one, with SQLite's extended code and what the engine
+// was doing. Later failures and refusals do not replace it.
+void expectFailureKept(Store& store, int code, const std::string& operation) {
+    const char* doing = nullptr;
+    EXPECT_EQ(sqlite3BtreeFailure(store.bt, &doing), code);
+    ASSERT_NE(doing, nullptr);
+    EXPECT_EQ(std::string(doing), operation);
+}
+
 // A fresh engine, opened once the faulty one is closed and the fault is gone,
 // works as if nothing had happened (what the store's reset gives).
 void expectFreshEngineWorks() {
@@ -447,6 +456,7 @@ TEST(EngineFaults, WriteErrorLosesEveryTableForGood) {
             expectEverythingLost(store, SQLITE_IOERR);
             scoped.faults().clearAll();
             expectEverythingLost(store, SQLITE_IOERR);
+            expectFailureKept(store, SQLITE_IOERR_WRITE, "inserting an entry");
             EXPECT_EQ(store.close(), SQLITE_OK);
             expectFreshEngineWorks();
         }
@@ -474,6 +484,7 @@ TEST(EngineFaults, FullDiskLosesEveryTableEvenWhenSpaceReturns) {
         expectEverythingLost(store, SQLITE_FULL);
         scoped.faults().setSpaceBudget(run.bytesAfterInserts * 4);
         expectEverythingLost(store, SQLITE_FULL);
+        expectFailureKept(store, SQLITE_FULL, "inserting an entry");
         EXPECT_EQ(store.close(), SQLITE_OK);
         EXPECT_EQ(scoped.faults().bytesInUse(), 0u);
         expectFreshEngineWorks();
@@ -509,6 +520,7 @@ void expectReadErrorDuringInsertsStopsWrites(FaultMode mode) {
         }
         EXPECT_EQ(total, static_cast<std::size_t>(store.firstFailureAt));
         expectWritesRefused(store);
+        expectFailureKept(store, SQLITE_IOERR_READ, "inserting an entry");
         for (int t = 0; t < kTables; ++t)
             EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
         EXPECT_EQ(store.close(), SQLITE_OK);
@@ -571,6 +583,7 @@ TEST(EngineFaults, ReadErrorInsideAnInsertCanCorruptThatTable) {
         }
     }
     expectWritesRefused(store);
+    expectFailureKept(store, SQLITE_IOERR_READ, "inserting an entry");
     EXPECT_EQ(store.close(), SQLITE_OK);
     expectFreshEngineWorks();
 }
@@ -632,6 +645,7 @@ TEST(EngineFaults, ReadErrorDuringWalksLosesNothingAndStopsWrites) {
                 EXPECT_EQ(store.model[t].size(), static_cast<std::size_t>(kRecords));
             }
             expectWritesRefused(store);
+            expectFailureKept(store, SQLITE_IOERR_READ, "moving a cursor");
             for (int t = 0; t < kTables; ++t) {
                 EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
                 EXPECT_EQ(store.model[t].size(), static_cast<std::size_t>(kRecords));
@@ -670,6 +684,7 @@ TEST(EngineFaults, TemporaryFileRefusedStopsWritesAndKeepsEveryEntry) {
             EXPECT_EQ(total, static_cast<std::size_t>(store.firstFailureAt));
             scoped.faults().clearAll();
             expectWritesRefused(store);
+            expectFailureKept(store, SQLITE_CANTOPEN, "inserting an entry");
             for (int t = 0; t < kTables; ++t)
                 EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
             EXPECT_EQ(store.close(), SQLITE_OK);

@@ -71,6 +71,24 @@ TEST(PagerModel, RandomProgramsMatchTheModel) {
     }
 }
 
+// Programs that also copy the pager, assign copies back and reset through them: the model
+// follows until the first such assignment or reset, and from then on the programs only drive
+// the store (the sanitizer pass watches them).
+TEST(PagerModel, RandomProgramsWithPagerCopiesRunClean) {
+    const int seeds = seedCount() / 2;
+    for (int seed = 1; seed <= seeds; ++seed) {
+        kovtest::ProgramOptions options = modelOptions();
+        options.pagerCopies = true;
+        kovtest::SeededChoices choices(static_cast<std::uint32_t>(seed));
+        kovtest::StoreProgram program(choices, options);
+        program.run(kSteps);
+        EXPECT_EQ(program.steps(), static_cast<std::uint64_t>(kSteps)) << "seed " << seed;
+        EXPECT_EQ(program.mismatches(), 0u) << "seed " << seed << ": " << program.firstMismatch();
+        if (::testing::Test::HasFailure())
+            return;
+    }
+}
+
 // A program of seed 1 was the first to find the engine answering a second search on a cursor
 // with a refusal instead of a position (a search while the cursor stood on a row of the same
 // search); it stays as a quick check of its own.

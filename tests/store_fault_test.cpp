@@ -49,6 +49,9 @@ struct Outcome {
     bool fired = false;
     bool degraded = false;
     std::string integrity;  // SQLite's integrity check right after the run, before the reset
+    bool failed = false;    // KovPager::failed() and failure() then
+    std::string failure;
+    bool failedAfterReset = true;  // failed() after the reset and the steps that follow it
     std::uint64_t calls[kov::test::kFaultKinds] = {};
     std::uint64_t bytes = 0;
 };
@@ -78,10 +81,13 @@ Outcome runWith(std::uint32_t seed, int steps, FaultPlan::Kind kind, std::uint64
     out.bytes = vfs.faults().bytesInUse();
     if (!armFault)
         out.integrity = kovtest::storeIntegrityProblems();
+    out.failed = KovPager::instance()->failed();
+    out.failure = KovPager::instance()->failure();
     // A fresh engine after reset works as before.
     program.forceReset();
     for (int i = 0; i < 200; ++i)
         program.step();
+    out.failedAfterReset = KovPager::instance()->failed();
     program.end();
     out.report = program.faultReport();
     out.mismatches = program.mismatches();
@@ -117,12 +123,21 @@ std::string describe(const Outcome& o) {
     return s;
 }
 
-// No fault: the program and its model agree, and the run goes well past the cache.
-void expectCleanAfterFault(const Outcome& o) {
+// No fault: the program and its model agree, and the run goes well past the cache. The host
+// was told: failed() from the fault on, failure() with the engine's message (`message`) and the
+// temporary directory; reset() cleared it.
+void expectCleanAfterFault(const Outcome& o, const std::string& message) {
     EXPECT_TRUE(o.fired);
     EXPECT_GE(o.report.faultedSteps, 1u);
     EXPECT_EQ(o.mismatches, 0u);  // every step outside the fault, and after reset, matched
     EXPECT_EQ(o.report.refusedInsertsStored, 0u);
+    EXPECT_TRUE(o.failed);
+    EXPECT_NE(o.failure.find(": " + message + " (SQLite result code "), std::string::npos)
+        << o.failure;
+    // (The program runs after the exit-time teardown, which leaves the engine its own default
+    // directory: the sentence names none.)
+    EXPECT_NE(o.failure.find("; temporary directory: "), std::string::npos) << o.failure;
+    EXPECT_FALSE(o.failedAfterReset);
 }
 
 }  // namespace
@@ -138,6 +153,8 @@ TEST(StoreFaults, ProgramPastTheCacheMatchesTheModel) {
     EXPECT_GT(o.calls[static_cast<int>(FaultKind::Read)], 100u);
     EXPECT_GT(o.bytes, 32u * 1024 * 1024);
     EXPECT_EQ(o.integrity, "");
+    EXPECT_FALSE(o.failed);
+    EXPECT_EQ(o.failure, "");
 }
 
 // A failed read, once or for 40 steps: the operation that met it did nothing (a refused insert
@@ -154,7 +171,7 @@ TEST(StoreFaults, ReadErrorsLeaveEveryTableWhole) {
             Outcome o = runWith(kSeed, kSteps, FaultPlan::Kind::Read, n, mode, true);
             SCOPED_TRACE(std::string(mode == FaultMode::Once ? "once" : "persistent") +
                          " at read " + std::to_string(n) + ": " + describe(o));
-            expectCleanAfterFault(o);
+            expectCleanAfterFault(o, "disk I/O error");
             EXPECT_FALSE(o.degraded);
             EXPECT_TRUE(o.writesRefused);
             EXPECT_EQ(o.report.tablesBroken, 0u);
@@ -190,7 +207,9 @@ TEST(StoreFaults, WriteErrorsAndAFullDiskLoseEveryTable) {
         Outcome o = runWith(kSeed, kSteps, p.kind, p.n, p.mode, true);
         SCOPED_TRACE(std::string(FaultPlan::name(p.kind)) + " at " + std::to_string(p.n) + ": " +
                      describe(o));
-        expectCleanAfterFault(o);
+        expectCleanAfterFault(o, p.kind == FaultPlan::Kind::FullDisk
+                                     ? "database or disk is full"
+                                     : "disk I/O error");
         EXPECT_TRUE(o.degraded);
         EXPECT_TRUE(o.writesRefused);
         EXPECT_EQ(o.report.tablesIntact, 0u);
@@ -210,7 +229,7 @@ TEST(StoreFaults, TemporaryFileRefusedCostsOnlyTheRefusedInserts) {
         Outcome o = runWith(kSeed, kSteps, FaultPlan::Kind::TempOpen, 1, mode, true);
         SCOPED_TRACE(std::string(mode == FaultMode::Once ? "once: " : "persistent: ") +
                      describe(o));
-        expectCleanAfterFault(o);
+        expectCleanAfterFault(o, "unable to open database file");
         EXPECT_EQ(o.report.tablesBroken, 0u);
         EXPECT_EQ(o.report.entriesLost, 0u);
         EXPECT_GT(o.report.tablesIntact, 0u);

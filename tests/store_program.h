@@ -44,6 +44,7 @@
 #include <iterator>
 #include <map>
 #include <memory>
+#include <new>
 #include <random>
 #include <sstream>
 #include <string>
@@ -122,6 +123,11 @@ struct ProgramOptions {
     int destroyTablePercent = 100;
     // Destroy a table only when no cursor made on it is left (the order the store asks for).
     bool cursorsBeforeTables = false;
+    // Copies of the pager taken, assigned back (and assigned to), reset() called through a copy.
+    // The model does not follow the store from the first assignment back or reset through a
+    // copy: from then on the program only drives the store (no crash, no sanitizer report is
+    // what is asked).
+    bool pagerCopies = false;
     // Faults: see above. Null means no faults.
     std::function<std::uint64_t()> faultEvents;
     std::function<bool()> faultsArmed;
@@ -130,6 +136,18 @@ struct ProgramOptions {
     // Called after a table creation opened a fresh engine.
     std::function<void()> onEngineOpened;
 };
+
+// The options of a store fuzz target's input (tests/fuzz/store_fuzz.cpp) from its first byte:
+// bit 0 set = tables are destroyed only after their cursors (the order the store asks for);
+// bit 1 set = some records are a few KB long; bit 2 set = pager copies.
+inline ProgramOptions fuzzVariant(std::uint8_t variant) {
+    ProgramOptions options;
+    options.oddInputs = true;
+    options.cursorsBeforeTables = (variant & 1) != 0;
+    options.bigPercent = (variant & 2) != 0 ? 5 : 0;
+    options.pagerCopies = (variant & 4) != 0;
+    return options;
+}
 
 // What a resync found in each model table, summed over the run.
 struct FaultReport {
@@ -152,7 +170,10 @@ class StoreProgram {
     StoreProgram(ChoiceSource& choices, ProgramOptions options)
         : in_(choices), opt_(std::move(options)) {}
 
-    ~StoreProgram() { clearHost(); }
+    ~StoreProgram() {
+        clearHost();
+        disposeCopies();
+    }
 
     StoreProgram(const StoreProgram&) = delete;
     StoreProgram& operator=(const StoreProgram&) = delete;
@@ -169,6 +190,9 @@ class StoreProgram {
     // The same in pieces, for callers that arm faults between steps.
     void begin() {
         clearHost();
+        disposeCopies();
+        unmodelled_ = false;
+        faultSinceReset_ = false;
         KovPager::instance()->reset();
         KovTestAccess::teardown();
         engineOpen_ = false;
@@ -185,9 +209,10 @@ class StoreProgram {
         ++step_;
     }
     void end() {
-        if (dirty_ && !armed())
+        if (dirty_ && !armed() && !unmodelled_)
             resync();
         clearHost();
+        disposeCopies();
         KovTestAccess::teardown();
     }
 
@@ -273,6 +298,55 @@ class StoreProgram {
         tables_.clear();
     }
 
+    // A copy of the pager lives in storage of the program's own: the destructor of a copy is
+    // private, KovTestAccess runs it without touching the engine the copy shares.
+    struct PagerCopy {
+        alignas(KovPager) unsigned char storage[sizeof(KovPager)];
+        KovPager* pager = nullptr;
+    };
+    void disposeCopies() {
+        for (auto& c : copies_)
+            KovTestAccess::disposeCopy(c->pager);
+        copies_.clear();
+    }
+
+    // Takes a copy, assigns one back or the pager to one, resets through one, assigns the pager
+    // to itself. What the model cannot follow stops it for the rest of the run.
+    void pagerAction() {
+        const int a = pick(6);
+        if (a == 0 || copies_.empty()) {
+            if (copies_.size() >= 3)
+                return;
+            last_ = "copy the pager";
+            auto c = std::make_unique<PagerCopy>();
+            c->pager = new (c->storage) KovPager(*KovPager::instance());
+            copies_.push_back(std::move(c));
+            return;
+        }
+        KovPager& copy = *copies_[static_cast<std::size_t>(pick(static_cast<int>(copies_.size())))]
+                              ->pager;
+        if (a == 1 || a == 2) {
+            last_ = "assign a copy back";
+            *KovPager::instance() = copy;
+            leaveTheModel();
+        } else if (a == 3) {
+            last_ = "reset through a copy";
+            copy.reset();
+            leaveTheModel();
+        } else if (a == 4) {
+            last_ = "assign the pager to a copy";
+            copy = *KovPager::instance();
+        } else {
+            last_ = "assign the pager to itself";
+            KovPager* pager = KovPager::instance();
+            *pager = *pager;
+        }
+    }
+    void leaveTheModel() {
+        unmodelled_ = true;
+        degraded_ = true;
+    }
+
     bool armed() const { return opt_.faultsArmed && opt_.faultsArmed(); }
     std::uint64_t events() const { return opt_.faultEvents ? opt_.faultEvents() : 0; }
 
@@ -299,7 +373,7 @@ class StoreProgram {
 
     void oneStepChecked() {
         // A fault disarmed since the last step: take the engine's state before going on.
-        if (dirty_ && !armed())
+        if (dirty_ && !armed() && !unmodelled_)
             resync();
         const std::uint64_t before = events();
         pending_.clear();
@@ -315,7 +389,8 @@ class StoreProgram {
                          static_cast<long long>(lastSlot_));
         }
         if (faulted) {
-            if (engineOpen_ && KovTestAccess::engine() != nullptr &&
+            faultSinceReset_ = true;
+            if (engineOpen_ && kov::engine::sqlite3BtreeIsOpen(KovTestAccess::engine()) &&
                 kov::engine::sqlite3BtreeTxnState(KovTestAccess::engine()) !=
                     kov::engine::SQLITE_TXN_WRITE)
                 writesRefused_ = true;
@@ -651,7 +726,8 @@ class StoreProgram {
             s.on = false;
         }
         writesRefused_ = false;
-        if (degraded_) {
+        faultSinceReset_ = false;
+        if (degraded_ && !unmodelled_) {
             // The handles of a damaged engine's slots were not followed; a fresh engine starts
             // from what the registry holds.
             adoptHandles();
@@ -957,6 +1033,8 @@ class StoreProgram {
         } else if (r < 27) {
             if (opt_.allowReset && chance(40))
                 reset();
+        } else if (r < 29 && opt_.pagerCopies) {
+            pagerAction();
         } else {
             HostCursor* c = someCursor();
             if (c == nullptr) {
@@ -989,6 +1067,13 @@ class StoreProgram {
 
     void check() {
         expectEq(KovTestAccess::engine() != nullptr, engineOpen_, "engine open");
+        // The host is told of a failure from the step that met it until reset().
+        const bool failed = KovPager::instance()->failed();
+        if (writesRefused_)
+            expectTrue(failed, "failed() after a fault that ended the writes");
+        else if (!faultSinceReset_)
+            expectTrue(!failed, "failed() without a fault: " + KovPager::instance()->failure());
+        expectEq(KovPager::instance()->failure().empty(), !failed, "failure() empty");
         const auto& real = KovTestAccess::slots();
         if (real.size() != slots_.size()) {
             expectEq(real.size(), slots_.size(), "registry size");
@@ -1220,6 +1305,8 @@ class StoreProgram {
     int generation_ = 0;
     bool dirty_ = false;
     bool degraded_ = false;
+    bool unmodelled_ = false;  // the model stopped following the store (pager copies)
+    bool faultSinceReset_ = false;
     bool writesRefused_ = false;
     bool unchecked_ = false;
     bool stopped_ = false;
@@ -1235,6 +1322,7 @@ class StoreProgram {
     std::vector<ModelSlot> slots_;
     std::vector<std::unique_ptr<HostTable>> tables_;
     std::vector<std::unique_ptr<HostCursor>> cursors_;
+    std::vector<std::unique_ptr<PagerCopy>> copies_;
 };
 
 }  // namespace kovtest

@@ -1,0 +1,66 @@
+// KovPager::failed() and failure() when the temporary directory exists but cannot take a file:
+// /proc, a directory that even root cannot create a file in, stands for a read-only file system.
+// The failure is met at the first spill of the cache, long after the directory was chosen.
+#include <gtest/gtest.h>
+
+#include <cstdint>
+#include <string>
+
+#include "engine/btree.h"
+#include "model_store_util.h"
+
+using namespace kovtest;
+
+namespace {
+
+// Points the store at another temporary directory (the engine reads it when it makes its
+// file); the pager's own one comes back on destruction.
+class TempDirOverride {
+  public:
+    explicit TempDirOverride(const std::string& dir) : saved_(pagerDir()) {
+        pagerDir() = dir;
+        kov::engine::temporaryDirectorySetting() = pagerDir().data();
+    }
+    ~TempDirOverride() {
+        pagerDir() = saved_;
+        kov::engine::temporaryDirectorySetting() = pagerDir().data();
+    }
+    TempDirOverride(const TempDirOverride&) = delete;
+    TempDirOverride& operator=(const TempDirOverride&) = delete;
+
+  private:
+    static std::string& pagerDir() { return KovTestAccess::tempDir(KovPager::instance()); }
+    std::string saved_;
+};
+
+}  // namespace
+
+TEST_F(StoreTest, TemporaryDirectoryThatCannotTakeAFile) {
+    {
+        TempDirOverride proc("/proc");
+        KovPager::instance()->reset();
+        KovBtree table(KovBtree::IntKeyTable);
+        // A cache of 10 pages: the file is wanted after a few records, not after 64 MiB.
+        kov::engine::sqlite3BtreeSetCacheSize(KovTestAccess::engine(), 10);
+        KovBtreeCursor c(table, true);
+        const std::string data(1000, 'd');
+        std::int64_t k = 0;
+        for (; k < 10000 && !KovPager::instance()->failed(); ++k)
+            c.insert(k, data.data(), data.size());
+        ASSERT_TRUE(KovPager::instance()->failed()) << "no file was ever wanted";
+        const std::string text = KovPager::instance()->failure();
+        EXPECT_NE(text.find("while inserting an entry"), std::string::npos) << text;
+        EXPECT_NE(text.find("unable to open database file"), std::string::npos) << text;
+        EXPECT_NE(text.find("temporary directory: /proc."), std::string::npos) << text;
+        // Everything inserted before reads back; writes are refused from here on.
+        std::int64_t n = 0;
+        for (bool on = c.first(); on; on = c.next())
+            ++n;
+        EXPECT_EQ(n, k - 1);
+        c.insert(-1, "x", 1);
+        EXPECT_NE(c.seek(std::int64_t{-1}), 0);
+    }
+    KovPager::instance()->reset();
+    EXPECT_FALSE(KovPager::instance()->failed());
+    EXPECT_EQ(KovPager::instance()->failure(), "");
+}
