@@ -6,17 +6,12 @@
 // false, seeks negative, sizes 0.
 #include <kovpager/KovBtreeCursor.h>
 
+#include <cassert>
 #include <cstring>
 
 #include "engine/btree.h"
 
 namespace eng = kov::engine;
-
-namespace {
-
-constexpr std::uint32_t kFreeSlot = 0xFFFFFFFFu;
-
-}  // namespace
 
 KovBtreeCursor::KovBtreeCursor(const KovBtree& table, bool write)
     : registry_(nullptr), slotIndex_(0) {
@@ -42,9 +37,11 @@ KovBtreeCursor::~KovBtreeCursor() {
     if (slot.cursor != nullptr)
         eng::sqlite3BtreeCloseCursor(slot.cursor);
     slot.cursor = nullptr;
-    slot.rootPage = kFreeSlot;
-    while (!slots.empty() && slots.back().rootPage == kFreeSlot)
+    slot.rootPage = CursorSlot::freeSlot_;
+    while (!slots.empty() && slots.back().rootPage == CursorSlot::freeSlot_)
         slots.pop_back();
+    // The registry never ends in a free slot (KovPager.cpp, design note 2).
+    assert(slots.empty() || slots.back().rootPage != CursorSlot::freeSlot_);
 }
 
 eng::BtCursor* KovBtreeCursor::handle() const {

@@ -10,7 +10,8 @@
 //    engine (and do nothing).
 //
 // 2. The registry. cursorSlots_ holds one CursorSlot per registered cursor, in order of
-//    registration; a cursor names its slot by index. Slot states:
+//    registration; a cursor names its slot by index. Slot states (checked with assert in debug
+//    builds by checkRegistry at every change of the registry):
 //
 //      state                   cursor        rootPage
 //      live, open              engine cursor table's root
@@ -48,6 +49,7 @@
 //    holds any more). So every handle the pager uses is open or inert, never freed.
 #include <kovpager/KovPager.h>
 
+#include <cassert>
 #include <cstdlib>
 #include <cstring>
 #include <new>
@@ -60,7 +62,24 @@ namespace eng = kov::engine;
 
 namespace {
 
-constexpr std::uint32_t kFreeSlot = 0xFFFFFFFFu;
+// The registry's invariants (design note 2): a free slot holds no engine cursor, the last slot is
+// never free (trailing free slots are removed at once), and no engine cursor is named by two
+// slots (each slot closes its own). `closed`: inside a table creation, between closeAllCursors
+// and restoreAllCursors, every live slot's engine cursor is closed too.
+void checkRegistry(const std::vector<CursorSlot>& slots, bool closed = false) {
+#ifndef NDEBUG
+    std::unordered_set<const eng::BtCursor*> seen;
+    for (const CursorSlot& slot : slots) {
+        assert(slot.rootPage != CursorSlot::freeSlot_ || slot.cursor == nullptr);
+        assert(!closed || slot.cursor == nullptr);
+        assert(slot.cursor == nullptr || seen.insert(slot.cursor).second);
+    }
+    assert(slots.empty() || slots.back().rootPage != CursorSlot::freeSlot_);
+#else
+    (void)slots;
+    (void)closed;
+#endif
+}
 
 // Storage of the one pager. Static, so it outlives every host object.
 alignas(KovPager) unsigned char gPagerStorage[sizeof(KovPager)];
@@ -142,6 +161,7 @@ KovPager& KovPager::operator=(const KovPager& other) {
     for (eng::BtCursor* orphan : held)
         eng::sqlite3BtreeCloseCursor(orphan);
     cursorSlots_ = std::move(slots);
+    checkRegistry(cursorSlots_);
 
     tempDir_ = other.tempDir_;
     openFailure_ = other.openFailure_;
@@ -211,10 +231,11 @@ std::string KovPager::failure() const {
 }
 
 void KovPager::closeAllCursors(std::vector<std::string>& saved) {
+    checkRegistry(cursorSlots_);
     saved.resize(cursorSlots_.size());
     for (std::size_t i = 0; i < cursorSlots_.size(); ++i) {
         CursorSlot& slot = cursorSlots_[i];
-        if (slot.rootPage == kFreeSlot)
+        if (slot.rootPage == CursorSlot::freeSlot_)
             continue;
         std::int64_t size = 0;
         eng::sqlite3BtreeKeySize(slot.cursor, &size);
@@ -238,11 +259,12 @@ void KovPager::closeAllCursors(std::vector<std::string>& saved) {
             eng::sqlite3BtreeCloseCursor(slot.cursor);
         slot.cursor = nullptr;
     }
+    checkRegistry(cursorSlots_, true);
 }
 
 void KovPager::restoreAllCursors(const std::vector<std::string>& saved) {
     for (std::size_t i = 0; i < cursorSlots_.size(); ++i) {
-        if (cursorSlots_[i].rootPage == kFreeSlot)
+        if (cursorSlots_[i].rootPage == CursorSlot::freeSlot_)
             continue;
         eng::sqlite3BtreeCursor(engine_, cursorSlots_[i].rootPage, 1, nullptr, nullptr,
                                 &cursorSlots_[i].cursor);
@@ -259,6 +281,7 @@ void KovPager::restoreAllCursors(const std::vector<std::string>& saved) {
                                     static_cast<std::int64_t>(key.size()), &compare);
         }
     }
+    checkRegistry(cursorSlots_);
 }
 
 void KovPager::teardown() {

@@ -22,7 +22,7 @@ target_compile_definitions(${KOV_TEST} PRIVATE
 target_link_libraries(${KOV_TEST} PRIVATE ntdll)
 add_dependencies(${KOV_TEST} dll_host_win32 dll_host_win32_plugin kovpager)
 
-gtest_discover_tests(${KOV_TEST} DISCOVERY_TIMEOUT 60 PROPERTIES LABELS "unit" TIMEOUT 300)
+kov_discover_tests(${KOV_TEST} TIMEOUT 300)
 
 # The DLL exports the members of its three classes and nothing else: no
 # helper of ours, no standard-library instantiation, no SQLite.

@@ -143,7 +143,7 @@ TEST(EngineLarge, RunPastTheCacheSpillsIntoTheTemporaryDirectoryAndReadsBack) {
 
     {
         TempDirSetting setting(scratch.path().string());
-        TestEngine engine;  // flags 3, page size 4096, 16384 cache pages, BeginTrans(2)
+        TestEngine engine;  // the store's settings, BeginTrans(2)
         ASSERT_EQ(engine.openRc, SQLITE_OK);
         ASSERT_NE(engine.get(), nullptr);
         ASSERT_EQ(engine.pageSizeRc, SQLITE_OK);

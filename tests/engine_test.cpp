@@ -595,38 +595,39 @@ class EngineNextPrevious : public ::testing::Test {
     std::uint32_t root = 0;
 };
 
+namespace {
+
+// The flag a move leaves (kFlagSentinel when it wrote none), the move itself succeeding.
+template <typename Move>
+int flagOf(Move move, BtCursor* cur) {
+    int res = kFlagSentinel;
+    EXPECT_EQ(move(cur, &res), SQLITE_OK);
+    return res;
+}
+
+// Once on no entry, both directions report no entry and the cursor stays on none.
+void expectStepsFindNothing(BtCursor* cur) {
+    EXPECT_EQ(flagOf(sqlite3BtreeNext, cur), 1);
+    EXPECT_EQ(flagOf(sqlite3BtreePrevious, cur), 1);
+    EXPECT_NE(sqlite3BtreeEof(cur), 0);
+}
+
+}  // namespace
+
 TEST_F(EngineNextPrevious, NextPastLastEntrySetsFlagOneAndLeavesNoEntry) {
     TestCursor cur(engine.get(), root, 0);
-    int res = kFlagSentinel;
-    ASSERT_EQ(sqlite3BtreeLast(cur.get(), &res), SQLITE_OK);
-    ASSERT_EQ(res, 0);
-    ASSERT_EQ(sqlite3BtreeNext(cur.get(), &res), SQLITE_OK);
-    EXPECT_EQ(res, 1);
+    ASSERT_EQ(flagOf(sqlite3BtreeLast, cur.get()), 0);
+    EXPECT_EQ(flagOf(sqlite3BtreeNext, cur.get()), 1);
     EXPECT_NE(sqlite3BtreeEof(cur.get()), 0);
-    // Once on no entry, both directions report no entry.
-    res = kFlagSentinel;
-    ASSERT_EQ(sqlite3BtreeNext(cur.get(), &res), SQLITE_OK);
-    EXPECT_EQ(res, 1);
-    res = kFlagSentinel;
-    ASSERT_EQ(sqlite3BtreePrevious(cur.get(), &res), SQLITE_OK);
-    EXPECT_EQ(res, 1);
-    EXPECT_NE(sqlite3BtreeEof(cur.get()), 0);
+    expectStepsFindNothing(cur.get());
 }
 
 TEST_F(EngineNextPrevious, PreviousBeforeFirstEntrySetsFlagOneAndLeavesNoEntry) {
     TestCursor cur(engine.get(), root, 0);
-    int res = kFlagSentinel;
-    ASSERT_EQ(sqlite3BtreeFirst(cur.get(), &res), SQLITE_OK);
-    ASSERT_EQ(res, 0);
-    ASSERT_EQ(sqlite3BtreePrevious(cur.get(), &res), SQLITE_OK);
-    EXPECT_EQ(res, 1);
+    ASSERT_EQ(flagOf(sqlite3BtreeFirst, cur.get()), 0);
+    EXPECT_EQ(flagOf(sqlite3BtreePrevious, cur.get()), 1);
     EXPECT_NE(sqlite3BtreeEof(cur.get()), 0);
-    res = kFlagSentinel;
-    ASSERT_EQ(sqlite3BtreeNext(cur.get(), &res), SQLITE_OK);
-    EXPECT_EQ(res, 1);
-    res = kFlagSentinel;
-    ASSERT_EQ(sqlite3BtreePrevious(cur.get(), &res), SQLITE_OK);
-    EXPECT_EQ(res, 1);
+    expectStepsFindNothing(cur.get());
 }
 
 TEST_F(EngineNextPrevious, NeverPositionedCursorSetsFlagOne) {

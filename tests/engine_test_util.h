@@ -10,6 +10,7 @@
 #include <vector>
 
 #include "engine/btree.h"
+#include "kov_test_access.h"
 
 namespace kov::engine::test {
 
@@ -18,17 +19,19 @@ constexpr int kByteTable = 0;                             // byte-string key wit
 constexpr int kIntTable = BTREE_INTKEY | BTREE_LEAFDATA;  // integer key with data
 constexpr int kKeyOnlyTable = BTREE_ZERODATA;             // byte-string key only
 
-// An engine opened with the store's settings: flags 3, page size 4096,
-// 16384 cache pages, an exclusive write transaction. Closed on destruction
-// unless closed (or released) earlier.
+// An engine opened with the store's settings: flags 3, the pager's page and
+// cache sizes, an exclusive write transaction. Closed on destruction unless
+// closed (or released) earlier.
 class TestEngine {
   public:
     explicit TestEngine(bool beginWrite = true) {
         openRc =
             sqlite3BtreeOpen(nullptr, nullptr, &handle, BTREE_OMIT_JOURNAL | BTREE_NO_READLOCK);
         if (handle != nullptr) {
-            pageSizeRc = sqlite3BtreeSetPageSize(handle, 4096, -1);
-            cacheSizeRc = sqlite3BtreeSetCacheSize(handle, 16384);
+            pageSizeRc = sqlite3BtreeSetPageSize(
+                handle, static_cast<int>(KovTestAccess::defaultPageSize()), -1);
+            cacheSizeRc = sqlite3BtreeSetCacheSize(
+                handle, static_cast<int>(KovTestAccess::defaultCacheSize()));
             if (beginWrite)
                 beginRc = sqlite3BtreeBeginTrans(handle, 2);
         }

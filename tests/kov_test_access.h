@@ -24,6 +24,11 @@
 struct KovTestAccess {
     // --- KovPager ---
 
+    // The store's page size in bytes and page-cache size in pages, as the pager hands them to
+    // every engine it opens (constants: reading them constructs nothing).
+    static std::int64_t defaultPageSize() { return KovPager::defaultPageSize_; }
+    static std::int64_t defaultCacheSize() { return KovPager::defaultCacheSize_; }
+
     // The cursor registry.
     static const std::vector<CursorSlot>& slots() { return KovPager::instance()->cursorSlots_; }
 

@@ -28,7 +28,7 @@
 
 #include "engine/btree.h"
 #include "kov_test_access.h"
-#include "model_store_util.h"
+#include "pager_test_util.h"
 #include "support/FileSystem.h"
 
 extern "C" char** environ;

@@ -11,7 +11,7 @@
 #include <string>
 
 #include "engine/btree.h"
-#include "model_store_util.h"
+#include "pager_test_util.h"
 
 using namespace kovtest;
 

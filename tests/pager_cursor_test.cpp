@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "model_store_util.h"
+#include "pager_test_util.h"
 
 using namespace kovtest;
 

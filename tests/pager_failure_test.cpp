@@ -1,7 +1,7 @@
 // KovPager::failed() and failure(): a failure that loses or refuses data shows there, from the
 // operation that met it until reset(); the refusals the store makes by design do not. The I/O
 // faults (a failed read or write, a full disk, a temporary file refused) are injected in
-// tests/store_fault_test.cpp; here: the store's own refusals, the engine that cannot be opened,
+// tests/pager_fault_test.cpp; here: the store's own refusals, the engine that cannot be opened,
 // memory running out inside the engine, and a temporary directory that cannot take a file.
 #include <gtest/gtest.h>
 
@@ -10,7 +10,7 @@
 #include <string>
 
 #include "engine/btree.h"
-#include "model_store_util.h"
+#include "pager_test_util.h"
 // After the engine binding's header, which shares SQLite's result-code names.
 #include "engine/private_sqlite3.h"
 
@@ -82,7 +82,7 @@ TEST_F(StoreTest, RefusalsByDesignAreNotFailures) {
         writer.first();
         writer.indexKeyFetch("long prefix", 11, payload);
         EXPECT_LT(writer.seek(nullptr, 0), 0);
-        char buffer[4];
+        char buffer[100];
         writer.data(buffer, 100);                    // more than the entry holds
         KovBtree made(KovBtree::IndexTable);         // a table made while cursors are open
     }

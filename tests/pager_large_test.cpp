@@ -8,7 +8,7 @@
 #include <random>
 #include <string>
 
-#include "model_store_util.h"
+#include "pager_test_util.h"
 
 using namespace kovtest;
 

@@ -1,20 +1,6 @@
-// Model-based randomised test of the store.
-//
-// A seeded program of host actions (tables of every kind made and destroyed, read and writing
-// cursors made and destroyed, inserts with replacement, seeks, moves, reads, composite-key seeks
-// and fetches, tables made while cursors stand anywhere, and reset) runs against the store and,
-// step by step, against an in-memory model of what the store must do (StoreProgram, in
-// store_program.h, which the fault test, the fuzz target and the soak program share). After every
-// step the registry, the engine handle and every live cursor's position are compared with the
-// model; every answer that differs is a mismatch. After each program SQLite's own integrity check
-// goes over the whole database.
-//
-// The model keeps the engine's view: a map from root page to table contents, and one record per
-// registry slot with the state of its engine cursor (none, open, or inert after reset), whether
-// it writes, and where it stands. It encodes the refusals: read cursors lock writers out of their
-// table, inserts through read cursors add nothing, drops are refused while any cursor is open,
-// every cursor on a table is on no entry after an insert into it, and table creation closes and
-// reopens every live slot as a writing cursor searched to its saved key.
+// Model-based randomised test of the store: seeded programs of host actions (store_program.h
+// says what they do and what the model checks), every step compared with the model, and
+// SQLite's own integrity check of the whole database after each program.
 //
 // KOV_MODEL_SEEDS=N runs N seeds instead of the default 200.
 #include <gtest/gtest.h>
@@ -23,7 +9,7 @@
 #include <cstdlib>
 #include <string>
 
-#include "model_store_util.h"
+#include "pager_test_util.h"
 #include "store_program.h"
 
 namespace {

@@ -6,7 +6,7 @@
 #include <memory>
 
 #include "engine/btree.h"
-#include "model_store_util.h"
+#include "pager_test_util.h"
 
 using namespace kovtest;
 

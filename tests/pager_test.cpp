@@ -14,7 +14,7 @@
 
 #include "engine/private_sqlite3.h"
 
-#include "model_store_util.h"
+#include "pager_test_util.h"
 #include "tempdir/TempDirectory.h"
 
 using namespace kovtest;
@@ -70,9 +70,12 @@ TEST(Pager, InstanceFromTwoThreadsIsOnePagerWithOneEngine) {
 }
 
 TEST(Pager, EngineOpensWithFixedPageAndCacheSizes) {
+    // The store's fixed sizes: 4096-byte pages, 16384 of them (64 MiB) in the cache.
+    EXPECT_EQ(KovTestAccess::defaultPageSize(), 4096);
+    EXPECT_EQ(KovTestAccess::defaultCacheSize(), 16384);
     KovBtree table(KovBtree::IntKeyTable);
-    EXPECT_EQ(pragmaValue("PRAGMA page_size"), 4096);
-    EXPECT_EQ(pragmaValue("PRAGMA cache_size"), 16384);
+    EXPECT_EQ(pragmaValue("PRAGMA page_size"), KovTestAccess::defaultPageSize());
+    EXPECT_EQ(pragmaValue("PRAGMA cache_size"), KovTestAccess::defaultCacheSize());
 }
 
 TEST(Pager, EngineDirectorySettingIsThePagersOwnCopy) {

@@ -19,7 +19,10 @@
 #include <string>
 #include <vector>
 
-// store_program.h first: the engine binding's header goes before <sqlite3.h>.
+// The engine binding's header goes before <sqlite3.h> (fault_vfs.h): they share the result-code
+// names.
+#include "engine/btree.h"
+#include "kov_test_access.h"
 #include "store_program.h"
 // (separate block: clang-format keeps the order)
 #include "fault_vfs.h"

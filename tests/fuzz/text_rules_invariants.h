@@ -1,7 +1,7 @@
 // Properties of the text rules that hold for every input: the native path
 // form of both styles (support/NativePath.h) and stripCharacters
 // (tempdir/StripCharacters.h). Shared by the fuzz target text_rules_fuzz and
-// by the regression tests of the inputs it found (fuzz_regression_test).
+// by the regression tests of the inputs it found (support_fuzz_regression_test).
 //
 // checkTextRules(bytes) decodes one input and returns a description of the
 // first property that does not hold, or an empty string when all hold.

@@ -2,4 +2,4 @@
 # a test-only source compiled into this program alone; the library never
 # registers it.
 target_sources(${KOV_TEST} PRIVATE "${CMAKE_CURRENT_SOURCE_DIR}/fault_vfs.cpp")
-gtest_discover_tests(${KOV_TEST} DISCOVERY_TIMEOUT 60 PROPERTIES LABELS "unit")
+kov_discover_tests(${KOV_TEST})

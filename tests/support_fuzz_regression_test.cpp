@@ -1,16 +1,14 @@
-// Inputs found by the text-rules fuzz target (tests/fuzz/text_rules_fuzz),
-// kept as fixed tests, and the seed corpus run through the same property
-// checks, so that the properties are checked in every build, not only in
-// fuzz builds.
+// The path text rules (support/NativePath) and stripCharacters under the
+// text-rules fuzz target's property checks (tests/fuzz/text_rules_fuzz): the
+// inputs it found, kept as fixed tests, and its seed corpus, so that the
+// properties are checked in every build, not only in fuzz builds.
 #include <gtest/gtest.h>
 
 #include <cstdint>
-#include <random>
 #include <string>
 #include <vector>
 
 #include "fuzz/text_rules_invariants.h"
-#include "store_program.h"
 #include "support/NativePath.h"
 #include "tempdir/StripCharacters.h"
 
@@ -30,7 +28,7 @@ std::string bytes(const char* data, std::size_t size) {
 // is replaced by one in a single pass), so a second pass changes it again:
 // the Windows form is not idempotent for runs of three or more backslashes,
 // and splitting it drops the empty component between the two.
-TEST(FuzzRegression, WindowsFormOfALongBackslashRunIsNotIdempotent) {
+TEST(TextRulesFuzz, WindowsFormOfALongBackslashRunIsNotIdempotent) {
     const std::string input = bytes("\x03\x02/\\//x\\\\y/\\/\x8f\\", 15);
     EXPECT_EQ(kov::fuzz::checkTextRules(input), "");
 
@@ -44,7 +42,7 @@ TEST(FuzzRegression, WindowsFormOfALongBackslashRunIsNotIdempotent) {
 }
 
 // The smallest forms of the same finding.
-TEST(FuzzRegression, RunsOfBackslashesHalveOnEachPass) {
+TEST(TextRulesFuzz, RunsOfBackslashesHalveOnEachPass) {
     EXPECT_EQ(kov::path::nativeForm("a\\\\\\\\b", PathStyle::Windows), "a\\\\b");
     EXPECT_EQ(kov::path::nativeForm("a\\\\b", PathStyle::Windows), "a\\b");
     EXPECT_EQ(kov::path::nativeForm("\\\\\\x", PathStyle::Windows), "\\\\\\x");
@@ -56,7 +54,7 @@ TEST(FuzzRegression, RunsOfBackslashesHalveOnEachPass) {
 
 // The property checks themselves notice a broken rule: a form that differs
 // from the run-length rule and a strip that leaves a set byte are reported.
-TEST(FuzzRegression, PropertyChecksReportBrokenResults) {
+TEST(TextRulesFuzz, PropertyChecksReportBrokenResults) {
     EXPECT_EQ(kov::fuzz::detail::windowsRunModel("a\\\\\\b"), "a\\\\b");
     EXPECT_EQ(kov::fuzz::detail::windowsRunModel("\\\\srv\\share\\"), "\\\\srv\\share");
     EXPECT_EQ(kov::fuzz::detail::windowsRunModel("a//b/"), "a\\b");
@@ -71,7 +69,7 @@ TEST(FuzzRegression, PropertyChecksReportBrokenResults) {
 
 // Mode values outside 1..3: the two low bits choose the ends (5 strips the
 // front, 6 the end, 7 both, 4 and 0 nothing).
-TEST(FuzzRegression, ModeValuesOutsideTheNamedOnesUseTheirLowBits) {
+TEST(TextRulesFuzz, ModeValuesOutsideTheNamedOnesUseTheirLowBits) {
     const std::string text = "/a/";
     EXPECT_EQ(kov::stripCharacters(text, "/", static_cast<kov::StripMode>(0)), "/a/");
     EXPECT_EQ(kov::stripCharacters(text, "/", static_cast<kov::StripMode>(4)), "/a/");
@@ -81,7 +79,7 @@ TEST(FuzzRegression, ModeValuesOutsideTheNamedOnesUseTheirLowBits) {
 }
 
 // The seed corpus (tests/fuzz/corpus/text_rules) passes every property.
-TEST(FuzzRegression, SeedsKeepEveryProperty) {
+TEST(TextRulesFuzz, SeedsKeepEveryProperty) {
     const std::vector<std::string> seeds = {
         kov::fuzz::encodeTextRules(2, "/", "a//b/"),
         kov::fuzz::encodeTextRules(3, "\\", "\\\\srv\\share\\"),
@@ -103,41 +101,4 @@ TEST(FuzzRegression, SeedsKeepEveryProperty) {
     };
     for (const std::string& seed : seeds)
         EXPECT_EQ(kov::fuzz::checkTextRules(seed), "") << "seed of " << seed.size() << " bytes";
-}
-
-// The store fuzz target's check (tests/fuzz/store_fuzz.cpp) on fixed inputs: byte programs of
-// every variant (first byte), with out-of-range kinds, mismatching key forms and pager copies,
-// each checked step by step against the model (as long as it can follow). The fuzzer found no
-// input that breaks it; these keep the same check in every build.
-TEST(FuzzRegression, StoreByteProgramsMatchTheModel) {
-    std::mt19937 gen(2026);
-    for (int input = 0; input < 40; ++input) {
-        std::vector<std::uint8_t> bytes(200 + static_cast<std::size_t>(input) * 50);
-        for (auto& b : bytes)
-            b = static_cast<std::uint8_t>(gen());
-        bytes[0] = static_cast<std::uint8_t>(input & 7);
-        kovtest::ByteChoices choices(bytes.data() + 1, bytes.size() - 1);
-        kovtest::StoreProgram program(choices, kovtest::fuzzVariant(bytes[0]));
-        program.run(1000);
-        EXPECT_GT(program.operations(), 0u);
-        EXPECT_EQ(program.mismatches(), 0u) << "input " << input << ": " << program.firstMismatch();
-    }
-}
-
-// An empty program and a program of zeros (every choice the first one) end cleanly.
-TEST(FuzzRegression, StoreDegenerateByteProgramsEndCleanly) {
-    kovtest::ProgramOptions options;
-    options.oddInputs = true;
-    {
-        kovtest::ByteChoices none(nullptr, 0);
-        kovtest::StoreProgram program(none, options);
-        program.run(1000);
-        EXPECT_EQ(program.mismatches(), 0u);
-    }
-    const std::vector<std::uint8_t> zeros(4000, 0);
-    kovtest::ByteChoices choices(zeros.data(), zeros.size());
-    kovtest::StoreProgram program(choices, options);
-    program.run(1000);
-    EXPECT_GT(program.operations(), 100u);
-    EXPECT_EQ(program.mismatches(), 0u) << program.firstMismatch();
 }

@@ -1,7 +1,7 @@
 // Helpers for the store's tests: string-based wrappers over the cursor's pointer-and-size
 // interface, and a fixture that starts every test on an open engine with an empty registry.
-#ifndef KOVPAGER_TESTS_MODEL_STORE_UTIL_H
-#define KOVPAGER_TESTS_MODEL_STORE_UTIL_H
+#ifndef KOVPAGER_TESTS_PAGER_TEST_UTIL_H
+#define KOVPAGER_TESTS_PAGER_TEST_UTIL_H
 
 #include <gtest/gtest.h>
 
@@ -27,7 +27,7 @@ inline std::string storeIntegrityProblems() {
     return engine == nullptr ? std::string() : kov::engine::test::integrityProblems(engine);
 }
 
-constexpr std::uint32_t kFreeSlot = 0xFFFFFFFFu;
+constexpr std::uint32_t kFreeSlot = CursorSlot::freeSlot_;
 
 inline void insertBytes(KovBtreeCursor& c, const std::string& key, const std::string& data) {
     c.insert(key.data(), key.size(), data.data(), data.size());
@@ -98,4 +98,4 @@ class StoreTest : public ::testing::Test {
 
 }  // namespace kovtest
 
-#endif  // KOVPAGER_TESTS_MODEL_STORE_UTIL_H
+#endif  // KOVPAGER_TESTS_PAGER_TEST_UTIL_H

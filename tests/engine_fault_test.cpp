@@ -1,7 +1,7 @@
 // The engine binding under injected I/O failures and a full disk.
 //
-// The engine is driven the way the store drives it (flags 3, page size
-// 4096, an exclusive write transaction that is never committed, three
+// The engine is driven the way the store drives it (flags 3, the store's
+// page size, an exclusive write transaction that is never committed, three
 // tables of the store's three kinds, one writing cursor per table) with a
 // cache of 100 pages, so that a few MB of records already spill to the
 // temporary file. Each test arms one kind of fault at many points of a run
@@ -28,6 +28,7 @@
 
 #include "engine/btree.h"
 #include "fault_vfs.h"
+#include "kov_test_access.h"
 
 namespace {
 
@@ -84,7 +85,7 @@ class Store {
         openRc = sqlite3BtreeOpen(nullptr, nullptr, &bt, BTREE_OMIT_JOURNAL | BTREE_NO_READLOCK);
         if (bt == nullptr)
             return;
-        sqlite3BtreeSetPageSize(bt, 4096, -1);
+        sqlite3BtreeSetPageSize(bt, static_cast<int>(KovTestAccess::defaultPageSize()), -1);
         sqlite3BtreeSetCacheSize(bt, kCachePages);
         beginRc = sqlite3BtreeBeginTrans(bt, 2);
         for (int t = 0; t < kTables && createRc == SQLITE_OK; ++t)

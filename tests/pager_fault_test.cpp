@@ -5,7 +5,7 @@
 
 #include <string>
 
-#include "model_store_util.h"
+#include "pager_test_util.h"
 #include "store_program.h"
 #include "store_program_faults.h"
 // after the engine binding's header

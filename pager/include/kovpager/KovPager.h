@@ -52,11 +52,14 @@ struct Btree;
 struct BtCursor;
 }  // namespace kov::engine
 
-// One registered cursor: the engine cursor, the root page of its table (0xFFFFFFFF marks a free
+// One registered cursor: the engine cursor, the root page of its table (freeSlot_ marks a free
 // slot) and the table's engine flags (bit 0 set: integer keys).
 struct CursorSlot {
+    // The rootPage of a free slot.
+    static constexpr std::uint32_t freeSlot_ = 0xFFFFFFFFu;
+
     kov::engine::BtCursor* cursor;  // null while closed for a table creation, and when free
-    std::uint32_t rootPage;         // table the cursor walks; 0xFFFFFFFF = free slot
+    std::uint32_t rootPage;         // table the cursor walks; freeSlot_ = free slot
     std::uint32_t tableFlags;       // the table's flags when the cursor was registered
 };
 

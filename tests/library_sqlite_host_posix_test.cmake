@@ -1,4 +1,4 @@
 # A host that links the system's SQLite beside the shared library.
 find_package(SQLite3 REQUIRED)
 target_link_libraries(${KOV_TEST} PRIVATE SQLite::SQLite3 ${CMAKE_DL_LIBS})
-gtest_discover_tests(${KOV_TEST} DISCOVERY_TIMEOUT 60 PROPERTIES LABELS "unit" TIMEOUT 300)
+kov_discover_tests(${KOV_TEST} TIMEOUT 300)
