@@ -35,9 +35,13 @@
 //     onEntry false; it is freed only by sqlite3BtreeCloseCursor.
 //  5. Btree::writable is false from the first failure SQLite reports until
 //     the engine is closed; every write checks it first.
+//
+// Debug builds check these with assert (checkEngine, checkCursor) at every
+// operation that could break them; release builds compile the checks away.
 
 #include "engine/btree.h"
 
+#include <cassert>
 #include <cstring>
 #include <memory>
 #include <string>
@@ -95,6 +99,42 @@ struct BtCursor {
 
 namespace {
 
+// Invariants 2 and 4 for one cursor.
+void checkCursor(const BtCursor* cur) {
+    if (cur->bt == nullptr) {
+        assert(cur->table == nullptr && cur->cursor == nullptr && !cur->onEntry);
+        return;
+    }
+    assert(cur->table != nullptr && cur->cursor != nullptr);
+    assert(!cur->onEntry || kovsq_valid(cur->cursor));
+    assert(!cur->described || cur->onEntry);
+    (void)cur;
+}
+
+// Invariants 1, 2 and 5 for a whole engine (a walk over its cursors).
+void checkEngine(const Btree* bt) {
+#ifndef NDEBUG
+    int open = 0;
+    for (const auto& entry : bt->tables) {
+        const Table* t = entry.second.get();
+        assert(t->root == entry.first);
+        int readers = 0;
+        for (const BtCursor* c = t->cursors; c != nullptr; c = c->next) {
+            assert(c->bt == bt && c->table == t);
+            assert(c->next == nullptr || c->next->prev == c);
+            checkCursor(c);
+            readers += c->write ? 0 : 1;
+            ++open;
+        }
+        assert(readers == t->readCursors);
+    }
+    assert(open == bt->openCursors);
+    assert(bt->writable || bt->failureCode != SQLITE_OK);
+#else
+    (void)bt;
+#endif
+}
+
 int exec(sqlite3* db, const char* sql) { return sqlite3_exec(db, sql, nullptr, nullptr, nullptr); }
 
 bool isFailure(int rc) { return rc != SQLITE_OK && rc != SQLITE_DONE; }
@@ -141,6 +181,7 @@ int afterMove(BtCursor* cur, int rc) {
         return noteFailure(cur->bt, rc, kMoving);
     }
     cur->onEntry = kovsq_valid(cur->cursor) != 0;
+    checkCursor(cur);
     return rc;
 }
 
@@ -273,6 +314,7 @@ const char* resultText(int code) { return sqlite3_errstr(code); }
 int sqlite3BtreeClose(Btree* p) {
     if (p == nullptr)
         return SQLITE_MISUSE;
+    checkEngine(p);
     for (Btree** link = &gOpenEngines; *link != nullptr; link = &(*link)->nextOpen) {
         if (*link == p) {
             *link = p->nextOpen;
@@ -390,6 +432,7 @@ int sqlite3BtreeIntegrityCheck(Btree* p, int maxErrors, int* pnErr, std::string*
 int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags) {
     if (p == nullptr || piTable == nullptr)
         return SQLITE_MISUSE;
+    checkEngine(p);
     if (p->openCursors > 0)
         return SQLITE_LOCKED;
     if (p->transaction != Transaction::Write || !p->writable)
@@ -411,6 +454,7 @@ int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags) {
 int sqlite3BtreeDropTable(Btree* p, std::uint32_t iTable, int* piMoved) {
     if (p == nullptr || piMoved == nullptr)
         return SQLITE_MISUSE;
+    checkEngine(p);
     if (p->openCursors > 0)
         return SQLITE_LOCKED;
     if (p->transaction != Transaction::Write || !p->writable)
@@ -453,6 +497,7 @@ int sqlite3BtreeCursor(Btree* p, std::uint32_t iTable, int wrFlag, BtreeCompare 
     cur->write = wrFlag != 0;
     link(cur.get());
     *ppCur = cur.release();
+    checkEngine(p);
     return SQLITE_OK;
 }
 
@@ -460,8 +505,11 @@ int sqlite3BtreeCloseCursor(BtCursor* pCur) {
     if (pCur == nullptr)
         return SQLITE_MISUSE;
     if (pCur->bt != nullptr) {
+        Btree* bt = pCur->bt;
         unlink(pCur);
         kovsq_cursor_close(pCur->cursor);
+        pCur->cursor = nullptr;
+        checkEngine(bt);
     }
     delete pCur;
     return SQLITE_OK;
@@ -673,6 +721,7 @@ int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, cons
         if (c != pCur)
             kovsq_clear(c->cursor);
         leaveEntry(c);
+        assert(c == pCur || !kovsq_valid(c->cursor));  // invariant 3
     }
     // Empty data is handed on as zero bytes at a real address: SQLite copies
     // it with memcpy, which must not be given a null pointer.
