@@ -23,7 +23,11 @@ std::string FileInfo::fullPath() const {
 
 void FileInfo::setKind(std::int32_t kind) {
     // An unknown stored kind says nothing against the new one; a known,
-    // different kind means the path is not what the caller looks for.
+    // different kind means the path is not what the caller looks for. So a
+    // record presumed to exist, and the network prefix, are believed by
+    // directory objects until a forced read; on Windows a temporary-directory
+    // value of exactly two backslashes is therefore chosen and published as
+    // an empty text.
     if (kind_ != kUnknown && kind != kind_)
         exists_ = 0;
     kind_ = kind;

@@ -8,7 +8,8 @@
 //
 // The cached status is deliberate: once statusRead_ is set, nothing reads
 // the disk again until a forced refresh (see KovFile::refresh).
-#pragma once
+#ifndef KOVPAGER_SUPPORT_FILEINFO_H
+#define KOVPAGER_SUPPORT_FILEINFO_H
 
 #include <cstdint>
 #include <memory>
@@ -55,3 +56,5 @@ struct FileInfo {
 };
 
 }  // namespace lumo::ex
+
+#endif  // KOVPAGER_SUPPORT_FILEINFO_H

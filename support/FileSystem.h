@@ -7,7 +7,8 @@
 // Paths are native-form UTF-8 text (on POSIX the bytes given). Every call
 // reports failure through its result and never throws for a file-system
 // error.
-#pragma once
+#ifndef KOVPAGER_SUPPORT_FILESYSTEM_H
+#define KOVPAGER_SUPPORT_FILESYSTEM_H
 
 #include <cstdint>
 #include <fstream>
@@ -61,7 +62,8 @@ class FileSystem {
     // Renames, replacing an existing target; false when it cannot (a move
     // between devices included).
     virtual bool moveFile(const std::string& from, const std::string& to) = 0;
-    // The names in a directory without "." and ".."; false when it cannot be read.
+    // The names in a directory without "." and ".."; false when it cannot be
+    // read (the names read before the failure stay in `out`).
     virtual bool list(const std::string& path, std::vector<Entry>& out) = 0;
     // The current time in seconds since the epoch.
     virtual std::int64_t now() = 0;
@@ -81,3 +83,5 @@ FileSystem& fileSystem();
 FileSystem* TEST_setFileSystem(FileSystem* replacement);
 
 }  // namespace kov::fs
+
+#endif  // KOVPAGER_SUPPORT_FILESYSTEM_H

@@ -125,6 +125,8 @@ class Win32FileSystem final : public FileSystem {
         if (path.empty())
             return false;
         std::wstring pattern = toWide(path);
+        // A root that already ends in a backslash gets only the asterisk; a
+        // second backslash would make it a network path.
         pattern += pattern.back() == L'\\' ? L"*" : L"\\*";
         WIN32_FIND_DATAW data;
         HANDLE find = FindFirstFileW(pattern.c_str(), &data);

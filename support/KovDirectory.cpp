@@ -75,13 +75,16 @@ bool KovDirectory::create() {
 }
 
 bool KovDirectory::remove() {
-    if (!info_ || isChainRoot())
+    // The first record of its chain is never removed: a root ("/", "\", "C:"), the "." heading
+    // a relative path, and the one name of a relative path ("foo", "C:foo") alike.
+    if (!info_ || !info_->parent_)
         return false;
     kov::fs::FileSystem& fs = kov::fs::fileSystem();
     const std::string native = info_->fullPath();
     listing_.clear();
+    // A link to a directory goes by itself: listing through it would delete the entries of a
+    // directory this object does not own.
     if (fs.isLink(native)) {
-        // Take the link away, never what it points to.
         const bool removed = fs.removeLink(native);
         refresh(true);
         return removed;
@@ -182,12 +185,13 @@ bool KovDirectory::readEntries() {
     if (cacheOurs && info_->modificationTime_ < listingTime_)
         return true;
     kov::fs::FileSystem& fs = kov::fs::fileSystem();
-    const std::int64_t now = fs.now();
-    std::vector<kov::fs::Entry> names;
-    if (!fs.list(info_->fullPath(), names))
-        return false;
-    listingTime_ = now;
+    listingTime_ = fs.now();
     listing_.clear();
+    // A directory that cannot be listed (one that may be entered and changed but not read, mode
+    // 0300) still gives true, with the names read before the failure: none when it could not be
+    // opened. So such an empty directory is removed by remove().
+    std::vector<kov::fs::Entry> names;
+    static_cast<void>(fs.list(info_->fullPath(), names));
     listing_.reserve(names.size());
     for (const kov::fs::Entry& e : names) {
         listing_.emplace_back(*this, Utf8Text(e.name), 1,

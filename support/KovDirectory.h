@@ -17,7 +17,8 @@
 //
 // Failures are reported as false, never by an exception. No lock; one
 // thread at a time.
-#pragma once
+#ifndef KOVPAGER_SUPPORT_KOVDIRECTORY_H
+#define KOVPAGER_SUPPORT_KOVDIRECTORY_H
 
 #include <cstdint>
 #include <memory>
@@ -45,9 +46,13 @@ class KovDirectory : public KovFile {
     int rootKind() override;
     // Creates the directory, and first its missing parents (outermost first).
     bool create() override;
-    // Removes the directory and everything in it. Refused (false) for the
-    // first record of a chain that is a root. Single failures do not stop
-    // the walk; the result is whether the directory itself went.
+    // Removes the directory and everything in it. Refused (false), with
+    // nothing touched, for the first record of its path chain: a root ("/",
+    // "\", "C:"), the "." heading a relative path, and the one name of a
+    // relative path ("foo", or "C:foo" on Windows). A symbolic link (or
+    // junction) is taken away by itself. Single failures do not stop the
+    // walk; the result is whether the directory itself went. A directory
+    // that cannot be listed is removed when it is empty.
     bool remove() override;
     bool copyTo(const std::string& destination, bool overwrite) override;
     // Copies the tree: creates the destination, then copies every entry.
@@ -62,10 +67,12 @@ class KovDirectory : public KovFile {
     // Appends the entries whose names match `pattern` (".*" is everything).
     // False when the directory is missing or the pattern does not compile.
     virtual bool entries(std::vector<KovFile>& out, const std::string& pattern);
-    // Appends all entries; false when the directory cannot be listed.
+    // Appends all entries; false when the directory is missing. A directory
+    // that cannot be listed gives no entries (true).
     virtual bool entries(std::vector<KovFile>& out);
     // Reads the listing again when it is stale; false when the directory is
-    // missing or cannot be listed.
+    // missing. A directory that cannot be listed gives true and an empty
+    // listing (or the names read before the listing failed).
     virtual bool readEntries();
 
   private:
@@ -74,3 +81,5 @@ class KovDirectory : public KovFile {
 };
 
 }  // namespace lumo::ex
+
+#endif  // KOVPAGER_SUPPORT_KOVDIRECTORY_H

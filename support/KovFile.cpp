@@ -94,11 +94,14 @@ void KovFile::resolveCase() {
     refresh(false);
     if (info_->exists_)
         return;
-    std::unique_ptr<KovDirectory> parent = parentDirectory();
-    if (!parent || !parent->exists())
+    // Only a parent record is listed: the one name of a relative path has none, and stops here.
+    if (!info_->parent_)
+        return;
+    KovDirectory parent(info_->parent_);
+    if (!parent.exists())
         return;
     std::vector<KovFile> listed;
-    if (!parent->entries(listed, ".*"))
+    if (!parent.entries(listed, ".*"))
         return;
     for (const KovFile& entry : listed) {
         const FileInfo& e = *entry.info();
@@ -208,10 +211,16 @@ bool KovFile::isChainRoot() const {
 bool KovFile::create() {
     if (!info_)
         return false;
+    // An existing path is enough, a directory of that name included (its kind is 2 and it
+    // exists): nothing is touched.
     if (exists())
-        return kind() != FileInfo::kDirectory;
-    std::unique_ptr<KovDirectory> parent = parentDirectory();
-    if (!parent || !parent->create())
+        return true;
+    // A path without a parent record (a root, or the one name of a relative path such as "bar")
+    // cannot be created.
+    if (!info_->parent_)
+        return false;
+    KovDirectory parent(info_->parent_);
+    if (!parent.create())
         return false;
     std::fstream out;
     // Append mode creates the file and never truncates one made meanwhile.
@@ -243,6 +252,7 @@ bool KovFile::remove() {
     info_->statusRead_ = 0;
     info_->exists_ = 0;
     info_->kind_ = FileInfo::kUnknown;
+    // The file is gone: size and times are read again rather than answered from the old status.
     info_->statValid_ = 0;
     return true;
 }
@@ -277,7 +287,9 @@ bool KovFile::moveTo(const std::string& destination, bool overwrite) {
 }
 
 bool KovFile::moveTo(const Utf8Text& destination, bool overwrite) {
-    // A root ("/", ".", a drive) is never moved.
+    // A root ("/", ".", a drive) is never moved: it cannot be renamed, and the copy-and-delete
+    // fallback would copy everything under it and then report success, since removing a root is
+    // refused and a file object ignores what a directory removal reports.
     if (isChainRoot() || !exists())
         return false;
     KovFile target(destination, info_->caseMode_, false);
@@ -291,7 +303,9 @@ bool KovFile::moveTo(const Utf8Text& destination, bool overwrite) {
     std::unique_ptr<KovDirectory> parent = target.parentDirectory();
     if (parent)
         parent->create();
-    // The device the destination would live on: its own, or its directory's.
+    // The device the destination would live on: its own, or its directory's. A destination that
+    // does not exist yet has no device of its own, and comparing with 0 would turn every move to
+    // a new name into a copy and a delete.
     const std::uint32_t targetDevice =
         target.info_->exists_ ? target.device() : (parent ? parent->device() : 0);
     const std::string targetNative = target.info_->fullPath();

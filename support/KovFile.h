@@ -19,7 +19,8 @@
 //
 // Thread safety: none. Objects, and the records they share, are used from
 // one thread at a time.
-#pragma once
+#ifndef KOVPAGER_SUPPORT_KOVFILE_H
+#define KOVPAGER_SUPPORT_KOVFILE_H
 
 #include <cstdint>
 #include <cstdio>
@@ -70,7 +71,8 @@ class KovFile {
 
     // Finds the name as written on disk when this path is missing but a
     // sibling differs from it only in case. Runs once per object, never with
-    // case mode 1.
+    // case mode 1, and only under a parent record (the one name of a
+    // relative path is not resolved).
     virtual void resolveCase();
     // The root kind of the first record of the path (see KovDirectory).
     virtual int rootKind();
@@ -81,7 +83,9 @@ class KovFile {
     virtual std::int64_t accessTime();
     virtual std::int64_t creationTime();
     // Creates an empty file, and first its missing parent directories. True
-    // when the file exists already. False for a path that is a directory.
+    // at once, touching nothing, when the path exists already (a directory
+    // of that name included). False for a path without a parent record (a
+    // root, or the one name of a relative path such as "bar").
     virtual bool create();
     // Deletes the file. True when there is nothing to delete. A directory is
     // handed to directory removal whose result is ignored (true).
@@ -139,3 +143,5 @@ class KovFile {
 };
 
 }  // namespace lumo::ex
+
+#endif  // KOVPAGER_SUPPORT_KOVFILE_H

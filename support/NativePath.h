@@ -1,9 +1,12 @@
 // Path text rules, as pure functions of the text so that the rules of both
 // platforms are checked everywhere.
 //
-// Windows style: "/" becomes "\"; trailing backslashes are stripped; runs
-// of backslashes collapse to one, except that a leading pair (a network
-// path) survives. The empty path, "/" and "\\" stand as they are.
+// Windows style: "/" becomes "\"; trailing backslashes are stripped; each
+// pair of backslashes is replaced by one, in a single pass from the left, so
+// a run of k backslashes becomes (k + 1) / 2 of them (two become one, three
+// and four become two): a run is not collapsed to one. A leading run keeps
+// one more, so that the pair of a network path survives. The empty path, "/"
+// and "\\" stand as they are.
 //   "a//b/" -> "a\b"      "\\\\srv\\share\\" -> "\\srv\share"
 //
 // POSIX style: "/" is the only separator and a backslash is an ordinary
@@ -13,7 +16,8 @@
 //
 // A native path splits into components, one per path record, the first of
 // which may be a root record (see rootRecordKind).
-#pragma once
+#ifndef KOVPAGER_SUPPORT_NATIVEPATH_H
+#define KOVPAGER_SUPPORT_NATIVEPATH_H
 
 #include <string>
 #include <string_view>
@@ -65,3 +69,5 @@ std::string joinComponent(std::string_view parent, std::string_view name, PathSt
 std::string portableForm(std::string_view path, PathStyle style);
 
 }  // namespace kov::path
+
+#endif  // KOVPAGER_SUPPORT_NATIVEPATH_H

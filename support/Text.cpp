@@ -122,8 +122,11 @@ char32_t foldOne(char32_t c) {
         return c;
     if (c >= 0xC0 && c <= 0xDE && c != 0xD7)
         return c + 0x20;  // Latin-1
-    if (c >= 0x100 && c <= 0x137 && (c % 2) == 0)
-        return c + 1;  // Latin Extended-A
+    // Latin Extended-A. U+0130 (capital I with dot above) has no simple
+    // folding of its own: it stays as it is rather than becoming U+0131
+    // (dotless i), which is no fold of it.
+    if (c >= 0x100 && c <= 0x137 && (c % 2) == 0 && c != 0x130)
+        return c + 1;
     if (c >= 0x139 && c <= 0x148 && (c % 2) == 1)
         return c + 1;
     if (c >= 0x14A && c <= 0x177 && (c % 2) == 0)

@@ -11,7 +11,8 @@
 //   std::u16string wide = kov::text::utf8ToUtf16Lossy(dir.bytes());
 //
 // Every function is pure and thread-safe.
-#pragma once
+#ifndef KOVPAGER_SUPPORT_TEXT_H
+#define KOVPAGER_SUPPORT_TEXT_H
 
 #include <cstddef>
 #include <string>
@@ -56,11 +57,14 @@ bool utf8ToNarrow(std::string_view utf8, std::string& out);
 std::string utf8ToNarrowLossy(std::string_view utf8);
 
 // Simple case folding (ASCII, Latin-1, Latin Extended-A, Greek and Cyrillic
-// capitals to small letters). Bytes that are not well-formed UTF-8 are kept
-// as they are, with only ASCII letters folded.
+// capitals to small letters). U+0130 (capital I with dot above), which has
+// no simple folding, is kept as it is. Bytes that are not well-formed UTF-8
+// are kept as they are, with only ASCII letters folded.
 std::string foldCase(std::string_view utf8);
 
 // Equality after foldCase.
 bool equalsIgnoringCase(std::string_view a, std::string_view b);
 
 }  // namespace kov::text
+
+#endif  // KOVPAGER_SUPPORT_TEXT_H

@@ -23,14 +23,21 @@
 //   - unset or empty: skipped; the search goes on to the next candidate.
 //   - only separators: on POSIX ("/", "///") treated as unset and skipped: the value names the
 //     root of the file system, no place for a store's temporary file, and it would publish as an
-//     empty text. On Windows ("\\", "/", "/\\/") it names the root of the current drive, which
-//     exists: it is chosen and published as an empty text, which the engine then reads as "use
-//     your own default directory".
+//     empty text. On Windows the value is tested like any other, and only two such values are
+//     chosen: a single "/" (its native form stays "/", the root of the current drive, which
+//     exists) and exactly two backslashes (the network prefix, whose record is presumed to
+//     exist). Either is published as an empty text, which the engine then reads as "use your
+//     own default directory". Every other value made only of separators (one backslash, "//",
+//     "/\/", three backslashes, ...) has an empty native form, which never exists: it is skipped.
+//     (In this item, characters are as written in the variable, not C escapes.)
 //   - very long (say 10 000 characters): tested like any other value; a path longer than the
 //     platform accepts is reported missing by the file system and skipped.
-//   - bytes that are not valid UTF-8 (or not valid in the ANSI code page): never converted or
-//     rejected; the bytes are the name. A value that names an existing directory wins and comes
-//     back byte for byte; one that names nothing is skipped like any missing directory.
+//   - bytes that are not valid UTF-8 (or not valid in the ANSI code page): never rejected. On
+//     POSIX nothing is converted: the bytes are the name; a value that names an existing
+//     directory wins and comes back byte for byte; one that names nothing is skipped like any
+//     missing directory. On Windows the directory object takes the value through the lossy
+//     conversion from the ANSI code page, so an undefined byte is replaced in the name that is
+//     tested, and what is published is that name converted back (lossily as well).
 //   - a regular file, or a directory that does not exist: skipped, nothing is created.
 //   - a bare drive ("Q:" or "Q:\\" on Windows) or a single ".": counts as an existing directory
 //     without asking the file system, and is published as "Q:" or ".".
@@ -51,9 +58,10 @@
 namespace kov {
 
 // The process's temporary directory, resolved on the first call and cached for the life of the
-// process. Returns a copy. Throws only std::bad_alloc (and std::system_error should the platform
-// refuse a lock); a throw during the first resolution leaves the cache unpublished, and the next
-// call resolves again.
+// process. Returns a copy. Throws std::bad_alloc, std::range_error from the trailing-separator
+// strip (stripCharacters) when the text has no UTF-8 form in the ANSI code page or the stripped
+// text none back (Windows only), and std::system_error should the platform refuse a lock; a throw
+// during the first resolution leaves the cache unpublished, and the next call resolves again.
 std::string getTempDirectory();
 
 // Resolves the temporary directory and publishes it in the process-wide cache, replacing whatever
@@ -61,7 +69,9 @@ std::string getTempDirectory();
 // list; the source published is the environment variable that supplied the winner, or empty.
 // A non-null `explicitDirectory` is taken as the answer as it stands: nothing is tested, created or
 // converted to native form, and the source published is empty. Either way trailing separators are
-// stripped before publishing, so a text made only of separators publishes as an empty text.
+// stripped before publishing (stripCharacters, through UTF-8), so a text made only of separators
+// publishes as an empty text. A std::range_error from the strip propagates and nothing is
+// published.
 void resolveTempDirectory(const char* explicitDirectory);
 
 // The value of the environment variable `name`, read under environmentMutex() in shared mode;

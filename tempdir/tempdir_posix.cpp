@@ -16,11 +16,14 @@ std::vector<TempDirectoryCandidate> tempDirectoryCandidates() {
     };
 }
 
+// "/" (however many slashes) names the file system's root: no place for the store's temporary
+// file, and it would publish as an empty text, so it is passed over like an unset variable.
 bool separatorOnlyValuesAreSkipped() {
     return true;
 }
 
 const std::string& tempDirectorySeparators() {
+    // Only "/" separates; a trailing backslash is part of the last name and is kept.
     static const std::string separators("/");
     return separators;
 }

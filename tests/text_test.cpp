@@ -53,6 +53,16 @@ TEST(Text, FoldsAsciiLatinGreekAndCyrillic) {
     EXPECT_EQ(kov::text::foldCase("\xC3\x97"), "\xC3\x97");                    // × stays
 }
 
+// Capital I with dot above (U+0130) has no simple folding: it stays, and is
+// not equal to the dotless small i (U+0131) that the Latin Extended-A
+// pairing would give; its neighbours still pair.
+TEST(Text, CapitalIWithDotAboveIsNotFolded) {
+    EXPECT_EQ(kov::text::foldCase("\xC4\xB0"), "\xC4\xB0");
+    EXPECT_FALSE(kov::text::equalsIgnoringCase("\xC4\xB0", "\xC4\xB1"));
+    EXPECT_EQ(kov::text::foldCase("\xC4\xAE"), "\xC4\xAF");  // U+012E -> U+012F
+    EXPECT_EQ(kov::text::foldCase("\xC4\xB2"), "\xC4\xB3");  // U+0132 -> U+0133
+}
+
 TEST(Text, FoldingKeepsBytesThatAreNotUtf8) {
     EXPECT_EQ(kov::text::foldCase("A\xFF"
                                   "B"),
