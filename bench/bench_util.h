@@ -14,6 +14,21 @@
 // sum of its own chunks, on the processor clock and on the wall clock;
 // setPairCounters reports per-operation times and the measured/raw ratio as
 // counters of the same benchmark run.
+//
+// A paired benchmark is written inside runPaired, which gives it a
+// PairedRun (the timer with the benchmark's state) and turns a failure into
+// a skipped benchmark:
+//
+//     void BM_X(benchmark::State& state) {
+//         runPaired(state, "store", [&](PairedRun& run) {
+//             ...tables...
+//             for (auto _ : state) {
+//                 run.sides(n, chunk, rawSide, measuredSide);
+//             }
+//         });
+//     }
+//
+// and main is initialize, then runWorkloads with the program's list.
 #ifndef KOVPAGER_BENCH_BENCH_UTIL_H
 #define KOVPAGER_BENCH_BENCH_UTIL_H
 
@@ -26,7 +41,9 @@
 #include <cstdlib>
 #include <cstring>
 #include <ctime>
+#include <stdexcept>
 #include <string>
+#include <utility>
 #include <vector>
 
 namespace kov::bench {
@@ -98,6 +115,23 @@ inline std::vector<std::size_t> randomIndices(std::size_t count, std::size_t bou
     return out;
 }
 
+// Seeds of the workloads' key material, one set for every program, so that
+// all of them insert, seek and walk the same keys.
+constexpr std::uint64_t kWorkloadKeySeed = 0x6b6f76;      // the N random 16-byte keys
+constexpr std::uint64_t kSeekSeed = 0x7365656b;           // which of them the seeks look for
+constexpr std::uint64_t kGroupPrefixSeed = 0x67726f7570;  // the composite keys' group prefixes
+constexpr std::uint64_t kPayloadSeed = 0x7061796c6f6164;  // their groups and payloads
+
+// The N random keys of the workloads, made on first use and kept; entry i
+// of every table is keys[i] with Payload entry i.
+inline const std::vector<Key16>& workloadKeys(std::size_t n) {
+    static std::vector<Key16> keys;
+    if (keys.size() != n) {
+        keys = randomKeys(n, kWorkloadKeySeed);
+    }
+    return keys;
+}
+
 // The 100-byte data of entry i: its index in the first 8 bytes, then a
 // fixed pattern.
 constexpr std::size_t kDataSize = 100;
@@ -135,6 +169,19 @@ struct Tally {
     }
     bool operator==(const Tally& other) const { return rows == other.rows && sum == other.sum; }
 };
+
+// Seconds of processor time the process has used (all its threads).
+inline double processCpuSeconds() {
+    timespec ts{};
+    clock_gettime(CLOCK_PROCESS_CPUTIME_ID, &ts);
+    return static_cast<double>(ts.tv_sec) + static_cast<double>(ts.tv_nsec) * 1e-9;
+}
+
+// Seconds on the steady clock.
+inline double steadySeconds() {
+    return std::chrono::duration<double>(std::chrono::steady_clock::now().time_since_epoch())
+        .count();
+}
 
 // Times two sides run alternately, chunk by chunk.
 // A moment, on both clocks.
@@ -198,11 +245,8 @@ class PairTimer {
   private:
     static Times now() {
         Times t;
-        t.wall = std::chrono::duration<double>(std::chrono::steady_clock::now().time_since_epoch())
-                     .count();
-        timespec ts{};
-        clock_gettime(CLOCK_PROCESS_CPUTIME_ID, &ts);
-        t.cpu = static_cast<double>(ts.tv_sec) + static_cast<double>(ts.tv_nsec) * 1e-9;
+        t.wall = steadySeconds();
+        t.cpu = processCpuSeconds();
         return t;
     }
 
@@ -229,6 +273,83 @@ inline void setPairCounters(benchmark::State& state, const PairTimer& timer,
     state.counters["raw_ns"] = timer.raw().cpu * 1e9 / ops;
     state.counters["ratio"] = timer.measured().cpu / timer.raw().cpu;
     state.counters["wall_ratio"] = timer.measured().wall / timer.raw().wall;
+}
+
+// One paired benchmark's timer together with the benchmark's state.
+class PairedRun {
+  public:
+    explicit PairedRun(benchmark::State& state) : state_(state) {}
+
+    // One iteration's timed part: raw and measured over [0, count) as
+    // PairTimer::run runs them; the measured side's elapsed time becomes the
+    // iteration's (manual) time.
+    template <class Raw, class Measured>
+    void sides(std::size_t count, std::size_t chunk, Raw&& raw, Measured&& measured,
+               std::size_t operations = PairTimer::kUnitsAreOperations) {
+        timer_.run(count, chunk, std::forward<Raw>(raw), std::forward<Measured>(measured),
+                   operations);
+        state_.SetIterationTime(timer_.takeMeasuredWallSeconds());
+    }
+    const PairTimer& timer() const { return timer_; }
+
+  private:
+    benchmark::State& state_;
+    PairTimer timer_;
+};
+
+// The frame of every paired benchmark: body(run) makes its tables and runs
+// the iterations; a failure skips the benchmark with its message, otherwise
+// the pair counters are reported with the measured side called `name`.
+template <class Body>
+void runPaired(benchmark::State& state, const std::string& name, Body&& body) {
+    PairedRun run(state);
+    try {
+        body(run);
+    } catch (const std::exception& e) {
+        state.SkipWithError(e.what());
+        return;
+    }
+    setPairCounters(state, run.timer(), name);
+}
+
+// Throws `what` unless the raw side read `rows` entries and the measured
+// side read the same entries.
+inline void checkTallies(const Tally& raw, const Tally& measured, std::size_t rows,
+                         const char* what) {
+    if (raw.rows != rows || !(raw == measured)) {
+        throw std::runtime_error(what);
+    }
+}
+
+// One workload of a paired program: its name, its function and how many
+// iterations it makes.
+struct PairedWorkload {
+    const char* name;
+    void (*fn)(benchmark::State&);
+    int iterations;
+};
+
+// Takes the workload size out of the arguments into *n and hands the rest to
+// Google Benchmark; false when it does not know one of them.
+inline bool initialize(int* argc, char** argv, std::int64_t* n) {
+    *n = takeWorkloadSize(argc, argv);
+    benchmark::Initialize(argc, argv);
+    return !benchmark::ReportUnrecognizedArguments(*argc, argv);
+}
+
+// Registers the workloads at size n, timed by the measured side's elapsed
+// time and shown in milliseconds, runs those the flags select, and shuts
+// Google Benchmark down.
+inline void runWorkloads(std::int64_t n, const std::vector<PairedWorkload>& workloads) {
+    for (const PairedWorkload& w : workloads) {
+        benchmark::RegisterBenchmark(w.name, w.fn)
+            ->Arg(n)
+            ->Iterations(w.iterations)
+            ->UseManualTime()
+            ->Unit(benchmark::kMillisecond);
+    }
+    benchmark::RunSpecifiedBenchmarks();
+    benchmark::Shutdown();
 }
 
 }  // namespace kov::bench

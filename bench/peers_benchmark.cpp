@@ -45,12 +45,10 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
-#include <chrono>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
 #include <cstring>
-#include <ctime>
 #include <exception>
 #include <memory>
 #include <string>
@@ -77,79 +75,58 @@ using kov::peers::CompositeKeys;
 using kov::peers::RandomKeys;
 using kov::peers::Shuffle;
 
-// The I/O system calls of this process so far (/proc/self/io; zeros where
-// the system has no such file).
-struct IoCounts {
-    double reads = 0;       // read system calls (syscr)
-    double writes = 0;      // write system calls (syscw)
-    double readBytes = 0;   // bytes they moved (rchar, wchar)
+// What the process has used so far: processor time (also split into user
+// and kernel time), elapsed time on the steady clock, and its I/O system
+// calls with the bytes they moved (/proc/self/io; zeros where the system has
+// no such file). Usage::now() is a moment, times in seconds; perOp makes the
+// same fields per operation between two moments, times in nanoseconds.
+struct Usage {
+    double cpu = 0;
+    double wall = 0;
+    double user = 0;
+    double sys = 0;
+    double reads = 0;      // read system calls (syscr)
+    double writes = 0;     // write system calls (syscw)
+    double readBytes = 0;  // bytes they moved (rchar, wchar)
     double writeBytes = 0;
-    static IoCounts now() {
-        IoCounts c;
+
+    static Usage now() {
+        Usage u;
         if (FILE* f = std::fopen("/proc/self/io", "r")) {
             char name[64];
             unsigned long long value = 0;
             while (std::fscanf(f, "%63[^:]: %llu\n", name, &value) == 2) {
                 const std::string field = name;
-                if (field == "syscr") c.reads = static_cast<double>(value);
-                if (field == "syscw") c.writes = static_cast<double>(value);
-                if (field == "rchar") c.readBytes = static_cast<double>(value);
-                if (field == "wchar") c.writeBytes = static_cast<double>(value);
+                if (field == "syscr") u.reads = static_cast<double>(value);
+                if (field == "syscw") u.writes = static_cast<double>(value);
+                if (field == "rchar") u.readBytes = static_cast<double>(value);
+                if (field == "wchar") u.writeBytes = static_cast<double>(value);
             }
             std::fclose(f);
         }
-        return c;
-    }
-};
-
-// A moment on the process's processor clock (also split into user and
-// kernel time), on the steady clock, and in the process's I/O counts.
-struct Moment {
-    double cpu = 0;
-    double wall = 0;
-    double user = 0;
-    double sys = 0;
-    IoCounts io;
-    static Moment now() {
-        Moment m;
-        m.io = IoCounts::now();
         rusage usage{};
         getrusage(RUSAGE_SELF, &usage);
-        m.user = static_cast<double>(usage.ru_utime.tv_sec) +
+        u.user = static_cast<double>(usage.ru_utime.tv_sec) +
                  static_cast<double>(usage.ru_utime.tv_usec) * 1e-6;
-        m.sys = static_cast<double>(usage.ru_stime.tv_sec) +
+        u.sys = static_cast<double>(usage.ru_stime.tv_sec) +
                 static_cast<double>(usage.ru_stime.tv_usec) * 1e-6;
-        timespec ts{};
-        clock_gettime(CLOCK_PROCESS_CPUTIME_ID, &ts);
-        m.cpu = static_cast<double>(ts.tv_sec) + static_cast<double>(ts.tv_nsec) * 1e-9;
-        m.wall = std::chrono::duration<double>(std::chrono::steady_clock::now().time_since_epoch())
-                     .count();
-        return m;
+        u.cpu = kov::bench::processCpuSeconds();
+        u.wall = kov::bench::steadySeconds();
+        return u;
     }
-};
 
-// Per operation between two moments: nanoseconds, and I/O system calls.
-struct PerOp {
-    double cpu = 0;
-    double wall = 0;
-    double user = 0;
-    double sys = 0;
-    double reads = 0;
-    double writes = 0;
-    double readBytes = 0;
-    double writeBytes = 0;
-    static PerOp of(const Moment& start, const Moment& stop, std::uint64_t ops) {
-        PerOp p;
+    static Usage perOp(const Usage& start, const Usage& stop, std::uint64_t ops) {
+        Usage p;
         if (ops > 0) {
             const double n = static_cast<double>(ops);
             p.cpu = (stop.cpu - start.cpu) * 1e9 / n;
             p.wall = (stop.wall - start.wall) * 1e9 / n;
             p.user = (stop.user - start.user) * 1e9 / n;
             p.sys = (stop.sys - start.sys) * 1e9 / n;
-            p.reads = (stop.io.reads - start.io.reads) / n;
-            p.writes = (stop.io.writes - start.io.writes) / n;
-            p.readBytes = (stop.io.readBytes - start.io.readBytes) / n;
-            p.writeBytes = (stop.io.writeBytes - start.io.writeBytes) / n;
+            p.reads = (stop.reads - start.reads) / n;
+            p.writes = (stop.writes - start.writes) / n;
+            p.readBytes = (stop.readBytes - start.readBytes) / n;
+            p.writeBytes = (stop.writeBytes - start.writeBytes) / n;
         }
         return p;
     }
@@ -157,8 +134,9 @@ struct PerOp {
 
 struct Result {
     std::uint64_t ops = 0;
-    PerOp measured;
-    PerOp fill;
+    // Per operation, of the measured phase and of the fill phase.
+    Usage measured;
+    Usage fill;
     std::uint64_t missing = 0;  // seeks that found nothing (must be 0)
     Tally tally;
     std::uint64_t diskBytes = 0;
@@ -225,9 +203,9 @@ constexpr double kMinReadSeconds = 0.2;
 
 template <class Pass>
 std::uint64_t repeatReads(Tally& tally, Pass pass) {
-    const Moment start = Moment::now();
+    const Usage start = Usage::now();
     std::uint64_t ops = pass(tally);
-    while (Moment::now().cpu - start.cpu < kMinReadSeconds) {
+    while (Usage::now().cpu - start.cpu < kMinReadSeconds) {
         Tally again;
         ops += pass(again);
     }
@@ -243,37 +221,37 @@ Result runWorkload(Backend& b, const std::string& workload, std::uint64_t n,
         b.beginInt();
         Shuffle order(n);
         bool shuffled = workload == "W2";
-        Moment start = Moment::now();
+        Usage start = Usage::now();
         for (std::uint64_t i = 0; i < n; ++i) {
             std::uint64_t key = shuffled ? order.at(i) : i;
             b.intInsert(static_cast<std::int64_t>(key), data.forEntry(key), kDataSize);
         }
         r.ops = n;
-        r.measured = PerOp::of(start, Moment::now(), n);
+        r.measured = Usage::perOp(start, Usage::now(), n);
     } else if (workload == "W3") {
-        Moment start = Moment::now();
+        Usage start = Usage::now();
         fillRandom(b, n);
         r.ops = n;
-        r.measured = PerOp::of(start, Moment::now(), n);
+        r.measured = Usage::perOp(start, Usage::now(), n);
     } else if (workload == "W4") {
-        Moment start = Moment::now();
+        Usage start = Usage::now();
         fillRandom(b, n);
-        Moment filled = Moment::now();
-        r.fill = PerOp::of(start, filled, n);
+        Usage filled = Usage::now();
+        r.fill = Usage::perOp(start, filled, n);
         r.ops = repeatReads(r.tally, [&](Tally& tally) {
             b.scan(tally);
             return tally.rows;
         });
-        r.measured = PerOp::of(filled, Moment::now(), r.ops);
+        r.measured = Usage::perOp(filled, Usage::now(), r.ops);
     } else if (workload == "W5") {
-        Moment start = Moment::now();
+        Usage start = Usage::now();
         fillRandom(b, n);
-        Moment filled = Moment::now();
-        r.fill = PerOp::of(start, filled, n);
+        Usage filled = Usage::now();
+        r.fill = Usage::perOp(start, filled, n);
         std::uint64_t seeks = std::max<std::uint64_t>(n / 10, std::min<std::uint64_t>(n, 100000));
         RandomKeys keys(n);
         r.ops = repeatReads(r.tally, [&](Tally& tally) {
-            kov::bench::Random pick(0x7365656b);
+            kov::bench::Random pick(kov::bench::kSeekSeed);
             for (std::uint64_t j = 0; j < seeks; ++j) {
                 Key16 k = keys.at(pick.below(n));
                 if (!b.seek(k.data(), k.size(), tally)) {
@@ -282,17 +260,17 @@ Result runWorkload(Backend& b, const std::string& workload, std::uint64_t n,
             }
             return seeks;
         });
-        r.measured = PerOp::of(filled, Moment::now(), r.ops);
+        r.measured = Usage::perOp(filled, Usage::now(), r.ops);
     } else if (workload == "W6") {
         b.beginKeys();
         CompositeKeys c;
-        Moment start = Moment::now();
+        Usage start = Usage::now();
         for (std::uint64_t i = 0; i < n; ++i) {
             Key16 k = c.next();
             b.keyInsert(k.data(), k.size());
         }
-        Moment filled = Moment::now();
-        r.fill = PerOp::of(start, filled, n);
+        Usage filled = Usage::now();
+        r.fill = Usage::perOp(start, filled, n);
         r.ops = repeatReads(r.tally, [&](Tally& tally) {
             std::uint64_t walked = 0;
             for (std::size_t g = 0; g < CompositeKeys::kGroups; ++g) {
@@ -300,7 +278,7 @@ Result runWorkload(Backend& b, const std::string& workload, std::uint64_t n,
             }
             return walked;
         });
-        r.measured = PerOp::of(filled, Moment::now(), r.ops);
+        r.measured = Usage::perOp(filled, Usage::now(), r.ops);
     } else {
         throw std::runtime_error("unknown workload " + workload + " (W1..W6)");
     }

@@ -1,5 +1,5 @@
 // Hand-written SQLite with the store's settings (bench/raw_sqlite.h: a
-// private temporary database, 4096-byte pages, a 16384-page cache, no
+// private temporary database, the store's page size and page-cache size, no
 // journal, the exclusive lock, one transaction never committed, prepared
 // statements, INSERT OR REPLACE).
 #ifndef KOVPAGER_BENCH_PEERS_RAW_H

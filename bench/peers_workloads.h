@@ -40,7 +40,7 @@ inline std::uint64_t mix(std::uint64_t z) {
 // 2i+1 and 2i+2, big-endian.
 class RandomKeys {
   public:
-    static constexpr std::uint64_t kSeed = 0x6b6f76;
+    static constexpr std::uint64_t kSeed = kov::bench::kWorkloadKeySeed;
     explicit RandomKeys(std::uint64_t n) : n_(n) {}
     std::uint64_t size() const { return n_; }
     Key16 at(std::uint64_t i) const {
@@ -99,7 +99,8 @@ class CompositeKeys {
     static constexpr std::size_t kPrefixSize = 8;
 
     CompositeKeys()
-        : prefixes_(kov::bench::randomKeys(kGroups, 0x67726f7570)), random_(0x7061796c6f6164) {
+        : prefixes_(kov::bench::randomKeys(kGroups, kov::bench::kGroupPrefixSeed)),
+          random_(kov::bench::kPayloadSeed) {
         walk_.resize(kGroups);
         for (std::size_t i = 0; i < kGroups; ++i) {
             walk_[i] = i;

@@ -2,10 +2,11 @@
 // by hand, with exactly the store's settings and nothing in between.
 //
 // One RawDatabase is one private connection on a temporary on-disk database
-// (opened with the empty file name, deleted by SQLite on close), with
-// 4096-byte pages, a 16384-page cache, no journal, the exclusive lock, no
-// syncing, and one exclusive transaction that is never committed: the
-// database lives and dies as scratch space, as the store's does.
+// (opened with the empty file name, deleted by SQLite on close), with the
+// store's page size and page-cache size (read from KovPager through
+// KovTestAccess: 4096-byte pages, 16384 of them), no journal, the exclusive
+// lock, no syncing, and one exclusive transaction that is never committed:
+// the database lives and dies as scratch space, as the store's does.
 //
 // Three table kinds mirror the store's:
 //   RawIntTable   (k INTEGER PRIMARY KEY, v BLOB)
@@ -20,6 +21,9 @@
 //
 // Every failure throws RawError with SQLite's message. Tables hold
 // statements of their database: destroy them before the database.
+//
+// At the end, the raw side of the workloads the engine and store programs
+// pair with their measured side (rawIntInserts, rawBlobInserts, ...).
 //
 //     kov::bench::RawDatabase db;
 //     kov::bench::RawBlobTable t(db);
@@ -38,6 +42,9 @@
 #include <stdexcept>
 #include <string>
 #include <vector>
+
+#include "bench/bench_util.h"
+#include "kov_test_access.h"
 
 namespace kov::bench {
 
@@ -153,8 +160,8 @@ class RawDatabase {
             throw RawError("open: " + message);
         }
         try {
-            exec("PRAGMA page_size=4096");
-            exec("PRAGMA cache_size=16384");
+            exec("PRAGMA page_size=" + std::to_string(KovTestAccess::defaultPageSize()));
+            exec("PRAGMA cache_size=" + std::to_string(KovTestAccess::defaultCacheSize()));
             exec("PRAGMA journal_mode=OFF");
             exec("PRAGMA locking_mode=EXCLUSIVE");
             exec("PRAGMA synchronous=OFF");
@@ -181,53 +188,59 @@ class RawDatabase {
         }
     }
 
-    // A fresh table name in this database.
-    std::string newTableName() { return "t" + std::to_string(++tables_); }
+    // Creates a table with a fresh name and the given column list and
+    // options ("(k BLOB PRIMARY KEY) WITHOUT ROWID"); returns its name.
+    std::string createTable(const std::string& definition) {
+        std::string name = "t" + std::to_string(++tables_);
+        exec("CREATE TABLE " + name + definition);
+        return name;
+    }
 
   private:
     sqlite3* db_ = nullptr;
     int tables_ = 0;
 };
 
-// (k INTEGER PRIMARY KEY, v BLOB).
-class RawIntTable {
+// What the tables with data share: the replacing insert of (k, v), whose
+// parameters the table binds, and the walk of every entry in key order.
+class RawDataTable {
   public:
-    explicit RawIntTable(RawDatabase& db) : RawIntTable(db, create(db)) {}
+    // Columns: 0 = key, 1 = data.
+    RawScan& scan() { return scan_; }
+
+  protected:
+    RawDataTable(RawDatabase& db, const std::string& name)
+        : insert_(db.handle(), "INSERT OR REPLACE INTO " + name + "(k, v) VALUES(?1, ?2)"),
+          scan_(db.handle(), "SELECT k, v FROM " + name + " ORDER BY k") {}
+
+    RawStatement insert_;
+    RawStatement scan_;
+};
+
+// (k INTEGER PRIMARY KEY, v BLOB); its scan's key column is an integer.
+class RawIntTable : public RawDataTable {
+  public:
+    explicit RawIntTable(RawDatabase& db)
+        : RawDataTable(db, db.createTable("(k INTEGER PRIMARY KEY, v BLOB)")) {}
 
     void insert(std::int64_t key, const void* data, std::size_t dataSize) {
         insert_.bindInt(1, key);
         insert_.bindBlob(2, data, dataSize);
         insert_.run();
     }
-    // Columns: 0 = key (integer), 1 = data.
-    RawScan& scan() { return scan_; }
-
-  private:
-    RawIntTable(RawDatabase& db, const std::string& name)
-        : insert_(db.handle(), "INSERT OR REPLACE INTO " + name + "(k, v) VALUES(?1, ?2)"),
-          scan_(db.handle(), "SELECT k, v FROM " + name + " ORDER BY k") {}
-    static std::string create(RawDatabase& db) {
-        std::string name = db.newTableName();
-        db.exec("CREATE TABLE " + name + "(k INTEGER PRIMARY KEY, v BLOB)");
-        return name;
-    }
-
-    RawStatement insert_;
-    RawStatement scan_;
 };
 
 // (k BLOB PRIMARY KEY, v BLOB) WITHOUT ROWID.
-class RawBlobTable {
+class RawBlobTable : public RawDataTable {
   public:
-    explicit RawBlobTable(RawDatabase& db) : RawBlobTable(db, create(db)) {}
+    explicit RawBlobTable(RawDatabase& db)
+        : RawBlobTable(db, db.createTable("(k BLOB PRIMARY KEY, v BLOB) WITHOUT ROWID")) {}
 
     void insert(const void* key, std::size_t keySize, const void* data, std::size_t dataSize) {
         insert_.bindBlob(1, key, keySize);
         insert_.bindBlob(2, data, dataSize);
         insert_.run();
     }
-    // Columns: 0 = key, 1 = data.
-    RawScan& scan() { return scan_; }
 
     // Point seek: when the key exists, copies up to `capacity` leading bytes
     // of its data into `buffer` and returns the data's full length;
@@ -248,17 +261,8 @@ class RawBlobTable {
 
   private:
     RawBlobTable(RawDatabase& db, const std::string& name)
-        : insert_(db.handle(), "INSERT OR REPLACE INTO " + name + "(k, v) VALUES(?1, ?2)"),
-          scan_(db.handle(), "SELECT k, v FROM " + name + " ORDER BY k"),
-          seek_(db.handle(), "SELECT v FROM " + name + " WHERE k = ?1") {}
-    static std::string create(RawDatabase& db) {
-        std::string name = db.newTableName();
-        db.exec("CREATE TABLE " + name + "(k BLOB PRIMARY KEY, v BLOB) WITHOUT ROWID");
-        return name;
-    }
+        : RawDataTable(db, name), seek_(db.handle(), "SELECT v FROM " + name + " WHERE k = ?1") {}
 
-    RawStatement insert_;
-    RawStatement scan_;
     RawStatement seek_;
 };
 
@@ -266,7 +270,8 @@ class RawBlobTable {
 // (a group prefix followed by a payload).
 class RawKeyTable {
   public:
-    explicit RawKeyTable(RawDatabase& db) : RawKeyTable(db, create(db)) {}
+    explicit RawKeyTable(RawDatabase& db)
+        : RawKeyTable(db, db.createTable("(k BLOB PRIMARY KEY) WITHOUT ROWID")) {}
 
     void insert(const void* key, std::size_t keySize) {
         insert_.bindBlob(1, key, keySize);
@@ -298,15 +303,68 @@ class RawKeyTable {
     RawKeyTable(RawDatabase& db, const std::string& name)
         : insert_(db.handle(), "INSERT OR IGNORE INTO " + name + "(k) VALUES(?1)"),
           walk_(db.handle(), "SELECT k FROM " + name + " WHERE k >= ?1 ORDER BY k") {}
-    static std::string create(RawDatabase& db) {
-        std::string name = db.newTableName();
-        db.exec("CREATE TABLE " + name + "(k BLOB PRIMARY KEY) WITHOUT ROWID");
-        return name;
-    }
 
     RawStatement insert_;
     RawStatement walk_;
 };
+
+// ---- The raw side of the paired workloads ----
+// Each returns the chunk function that PairedRun::sides runs as the raw
+// side: it does operations [begin, end) of the workload. What it is handed
+// must outlive it.
+
+// Inserts of the integer keys begin..end-1, entry i with Payload entry i.
+inline auto rawIntInserts(RawIntTable& table, Payload& data) {
+    return [&table, &data](std::size_t begin, std::size_t end) {
+        for (std::size_t i = begin; i < end; ++i) {
+            table.insert(static_cast<std::int64_t>(i), data.forEntry(i), kDataSize);
+        }
+    };
+}
+
+// Inserts of keys[begin..end), entry i with Payload entry i.
+inline auto rawBlobInserts(RawBlobTable& table, const std::vector<Key16>& keys, Payload& data) {
+    return [&table, &keys, &data](std::size_t begin, std::size_t end) {
+        for (std::size_t i = begin; i < end; ++i) {
+            table.insert(keys[i].data(), keys[i].size(), data.forEntry(i), kDataSize);
+        }
+    };
+}
+
+// Key-only inserts of keys[begin..end).
+inline auto rawKeyInserts(RawKeyTable& table, const std::vector<Key16>& keys) {
+    return [&table, &keys](std::size_t begin, std::size_t end) {
+        for (std::size_t i = begin; i < end; ++i) {
+            table.insert(keys[i].data(), keys[i].size());
+        }
+    };
+}
+
+// The next end - begin rows of an ordered scan, key and data copied into
+// the buffers and tallied. Reset the scan after the last chunk.
+inline auto rawScanRows(RawScan& scan, std::vector<unsigned char>& keyBuf,
+                        std::vector<unsigned char>& dataBuf, Tally& tally) {
+    return [&scan, &keyBuf, &dataBuf, &tally](std::size_t begin, std::size_t end) {
+        scan.copyRows(end - begin, keyBuf, dataBuf,
+                      [&tally](const unsigned char* key, std::size_t keySize,
+                               const unsigned char* data) { tally.add(key, keySize, data); });
+    };
+}
+
+// Seeks of keys[order[i]], i in [begin, end), the data read into `buffer`;
+// an entry found with 8 bytes of data or more is tallied.
+inline auto rawSeeks(RawBlobTable& table, const std::vector<Key16>& keys,
+                     const std::vector<std::size_t>& order, std::vector<unsigned char>& buffer,
+                     Tally& tally) {
+    return [&table, &keys, &order, &buffer, &tally](std::size_t begin, std::size_t end) {
+        for (std::size_t i = begin; i < end; ++i) {
+            const Key16& key = keys[order[i]];
+            if (table.seekData(key.data(), key.size(), buffer.data(), buffer.size()) >= 8) {
+                tally.add(key.data(), key.size(), buffer.data());
+            }
+        }
+    };
+}
 
 }  // namespace kov::bench
 

@@ -160,6 +160,30 @@ def fmt_n(n):
     return str(n)
 
 
+def md_table(header, align, rows):
+    """The lines of a Markdown table: the header cells, each column's alignment ("---" or "---:")
+    and the rows' cells."""
+    lines = ["| " + " | ".join(header) + " |", "|" + "".join(a + "|" for a in align)]
+    lines += ["| " + " | ".join(cells) + " |" for cells in rows]
+    return lines
+
+
+def per_workload_table(workloads, ns, backends, shown, cell):
+    """A table with a row per workload and N that `shown(w, n)` keeps, a column per backend and
+    `cell(w, n, b)` in it."""
+    rows = [[w, fmt_n(n)] + [cell(w, n, b) for b in backends]
+            for w in workloads for n in ns if shown(w, n)]
+    return md_table(["workload", "N"] + backends, ["---", "---:"] + ["---:"] * len(backends), rows)
+
+
+def per_backend_table(rows, ns, backends, cell):
+    """A table with a row per backend and a column per N: `cell(results)` of that backend's
+    results at that N, "-" where it gives None."""
+    return md_table(["backend"] + [f"N={fmt_n(n)}" for n in ns], ["---"] + ["---:"] * len(ns),
+                    [[b] + [cell([r for r in rows if r["backend"] == b and r["n"] == n]) or "-"
+                            for n in ns] for b in backends])
+
+
 def machine():
     model = "?"
     try:
@@ -252,9 +276,7 @@ def render(args, rows, results_md, chart_png, command):
              "median of the ratios of the runs made back to back. Wall = the same best-of ratio "
              "on elapsed time.")
     L.append("")
-    hdr = "| workload | " + " | ".join(f"N={fmt_n(n)} best-of | paired | wall" for n in ns) + " |"
-    L.append(hdr)
-    L.append("|---|" + "---:|---:|---:|" * len(ns))
+    headline = []
     for w in workloads:
         cells = []
         for n in ns:
@@ -274,46 +296,31 @@ def render(args, rows, results_md, chart_png, command):
             wall = min(r["ns_wall"] for r in s) / min(r["ns_wall"] for r in q)
             cells += [f"{ratio:.2f}", f"{statistics.median(paired):.2f}" if paired else "-",
                       f"{wall:.2f}"]
-        L.append(f"| {w} | " + " | ".join(cells) + " |")
+        headline.append([w] + cells)
+    L += md_table(["workload"] + [f"N={fmt_n(n)} best-of | paired | wall" for n in ns],
+                  ["---"] + ["---:"] * (3 * len(ns)), headline)
     L.append("")
 
     # ns/op per workload / backend / N.
     L.append("## Processor ns per operation (best of repetitions)")
     L.append("")
-    L.append("| workload | N | " + " | ".join(backends) + " |")
-    L.append("|---|---:|" + "---:|" * len(backends))
-    for w in workloads:
-        for n in ns:
-            if not any((w, n, b) in best for b in backends):
-                continue
-            cells = [fmt_ns(best[(w, n, b)]["ns_cpu"]) if (w, n, b) in best else "-"
-                     for b in backends]
-            L.append(f"| {w} | {fmt_n(n)} | " + " | ".join(cells) + " |")
+    L += per_workload_table(
+        workloads, ns, backends, lambda w, n: any((w, n, b) in best for b in backends),
+        lambda w, n, b: fmt_ns(best[(w, n, b)]["ns_cpu"]) if (w, n, b) in best else "-")
     L.append("")
     L.append("## Ratio to raw SQLite (processor time, best of repetitions; below 1 is faster)")
     L.append("")
-    L.append("| workload | N | " + " | ".join(backends) + " |")
-    L.append("|---|---:|" + "---:|" * len(backends))
-    for w in workloads:
-        for n in ns:
-            raw = best.get((w, n, "sqlite"))
-            if raw is None:
-                continue
-            cells = [f"{best[(w, n, b)]['ns_cpu'] / raw['ns_cpu']:.2f}" if (w, n, b) in best
-                     else "-" for b in backends]
-            L.append(f"| {w} | {fmt_n(n)} | " + " | ".join(cells) + " |")
+    L += per_workload_table(
+        workloads, ns, backends, lambda w, n: (w, n, "sqlite") in best,
+        lambda w, n, b: f"{best[(w, n, b)]['ns_cpu'] / best[(w, n, 'sqlite')]['ns_cpu']:.2f}"
+        if (w, n, b) in best else "-")
     L.append("")
     L.append("## Elapsed ns per operation (best of repetitions)")
     L.append("")
-    L.append("| workload | N | " + " | ".join(backends) + " |")
-    L.append("|---|---:|" + "---:|" * len(backends))
-    for w in workloads:
-        for n in ns:
-            if not any((w, n, b) in by for b in backends):
-                continue
-            cells = [fmt_ns(min(r["ns_wall"] for r in by[(w, n, b)])) if (w, n, b) in by
-                     else "-" for b in backends]
-            L.append(f"| {w} | {fmt_n(n)} | " + " | ".join(cells) + " |")
+    L += per_workload_table(
+        workloads, ns, backends, lambda w, n: any((w, n, b) in by for b in backends),
+        lambda w, n, b: fmt_ns(min(r["ns_wall"] for r in by[(w, n, b)])) if (w, n, b) in by
+        else "-")
     L.append("")
 
     # The store against LMDB, the fastest peer.
@@ -323,14 +330,14 @@ def render(args, rows, results_md, chart_png, command):
         L.append("Store time / LMDB time: at or below 1 the store is as fast as LMDB or faster.")
         L.append("")
         lmdb_ns = [n for n in ns if any((w, n, "lmdb") in best for w in workloads)]
-        L.append("| workload | " + " | ".join(f"N={fmt_n(n)}" for n in lmdb_ns) + " |")
-        L.append("|---|" + "---:|" * len(lmdb_ns))
+        cells = []
         for w in workloads:
-            cells = []
+            cells.append([w])
             for n in lmdb_ns:
                 s_, l_ = best.get((w, n, "store")), best.get((w, n, "lmdb"))
-                cells.append(f"{s_['ns_cpu'] / l_['ns_cpu']:.2f}" if s_ and l_ else "-")
-            L.append(f"| {w} | " + " | ".join(cells) + " |")
+                cells[-1].append(f"{s_['ns_cpu'] / l_['ns_cpu']:.2f}" if s_ and l_ else "-")
+        L += md_table(["workload"] + [f"N={fmt_n(n)}" for n in lmdb_ns],
+                      ["---"] + ["---:"] * len(lmdb_ns), cells)
         L.append("")
 
     # Where the processor time goes, and the temporary file's system calls.
@@ -343,9 +350,7 @@ def render(args, rows, results_md, chart_png, command):
                  "calls on the temporary file with the KiB they moved (/proc/self/io). Below "
                  "the cache nothing goes to the file.")
         L.append("")
-        L.append("| workload | N | backend | user ns | kernel ns | reads | KiB read | writes | "
-                 "KiB written |")
-        L.append("|---|---:|---|---:|---:|---:|---:|---:|---:|")
+        cells = []
         for w in workloads:
             for n in ns:
                 for b in ("store", "sqlite"):
@@ -354,10 +359,14 @@ def render(args, rows, results_md, chart_png, command):
                     if not cands or w == "W6i":
                         continue
                     r = min(cands, key=lambda r: r["ns_cpu"])
-                    L.append(f"| {w} | {fmt_n(n)} | {b} | {fmt_ns(r['ns_user'])} | "
-                             f"{fmt_ns(r['ns_sys'])} | {r['reads_per_op']:.2f} | "
-                             f"{r['read_bytes_per_op'] / 1024:.1f} | {r['writes_per_op']:.2f} | "
-                             f"{r['write_bytes_per_op'] / 1024:.1f} |")
+                    cells.append([w, fmt_n(n), b, fmt_ns(r["ns_user"]), fmt_ns(r["ns_sys"]),
+                                  f"{r['reads_per_op']:.2f}",
+                                  f"{r['read_bytes_per_op'] / 1024:.1f}",
+                                  f"{r['writes_per_op']:.2f}",
+                                  f"{r['write_bytes_per_op'] / 1024:.1f}"])
+        L += md_table(["workload", "N", "backend", "user ns", "kernel ns", "reads", "KiB read",
+                       "writes", "KiB written"],
+                      ["---", "---:", "---", "---:", "---:", "---:", "---:", "---:", "---:"], cells)
         L.append("")
 
     # Memory and disk.
@@ -366,14 +375,9 @@ def render(args, rows, results_md, chart_png, command):
     L.append("Includes the program itself (about 12 MiB before any work). LMDB's figure counts "
              "the pages of its memory map that the process touched.")
     L.append("")
-    L.append("| backend | " + " | ".join(f"N={fmt_n(n)}" for n in ns) + " |")
-    L.append("|---|" + "---:|" * len(ns))
-    for b in backends:
-        cells = []
-        for n in ns:
-            rs = [r["peak_rss_kib"] for r in rows if r["backend"] == b and r["n"] == n]
-            cells.append(f"{max(rs) / 1024:.0f}" if rs else "-")
-        L.append(f"| {b} | " + " | ".join(cells) + " |")
+    L += per_backend_table(
+        rows, ns, backends,
+        lambda rs: f"{max(r['peak_rss_kib'] for r in rs) / 1024:.0f}" if rs else None)
     L.append("")
     L.append("## Temporary disk in use at the end (MiB of allocated blocks, largest over the "
              "workloads run)")
@@ -382,14 +386,9 @@ def render(args, rows, results_md, chart_png, command):
              "SQLite keeps open (found through /proc/self/fd). The SQLite file exists only once "
              "the 64 MiB cache spills.")
     L.append("")
-    L.append("| backend | " + " | ".join(f"N={fmt_n(n)}" for n in ns) + " |")
-    L.append("|---|" + "---:|" * len(ns))
-    for b in backends:
-        cells = []
-        for n in ns:
-            rs = [r["disk_bytes"] for r in rows if r["backend"] == b and r["n"] == n]
-            cells.append(f"{max(rs) / 2**20:.0f}" if rs else "-")
-        L.append(f"| {b} | " + " | ".join(cells) + " |")
+    L += per_backend_table(
+        rows, ns, backends,
+        lambda rs: f"{max(r['disk_bytes'] for r in rs) / 2**20:.0f}" if rs else None)
     L.append("")
 
     # Cross-check of the read tallies.

@@ -37,13 +37,14 @@
 #include <vector>
 
 #include "bench/bench_util.h"
+#include "bench/paired_workloads.h"
 #include "bench/raw_sqlite.h"
 
 namespace {
 
 using kov::bench::kDataSize;
 using kov::bench::Key16;
-using kov::bench::PairTimer;
+using kov::bench::PairedRun;
 using kov::bench::Payload;
 using kov::bench::RawBlobTable;
 using kov::bench::RawDatabase;
@@ -51,9 +52,6 @@ using kov::bench::RawIntTable;
 using kov::bench::RawKeyTable;
 using kov::bench::Tally;
 
-constexpr std::size_t kInsertChunk = 1000;
-constexpr std::size_t kScanChunk = 4096;
-constexpr std::size_t kSeekChunk = 256;
 constexpr std::size_t kGroups = 1000;
 constexpr std::size_t kPrefixSize = 8;
 constexpr std::size_t kWalkChunk = 8;  // groups
@@ -69,14 +67,52 @@ struct TablePair {
 using BlobPair = TablePair<RawBlobTable>;
 using KeyPair = TablePair<RawKeyTable>;
 
-// The N random keys; entry i of every table is keys[i] with Payload entry i.
-const std::vector<Key16>& workloadKeys(std::size_t n) {
-    static std::vector<Key16> keys;
-    if (keys.size() != n) {
-        keys = kov::bench::randomKeys(n, 0x6b6f76);
+// A writing cursor on a store table, with what the shared workloads do
+// through it.
+class StoreCursor {
+  public:
+    explicit StoreCursor(KovBtree& table) : c_(table, true) {}
+    explicit StoreCursor(BlobPair& set) : StoreCursor(set.table) {}
+
+    KovBtreeCursor& get() { return c_; }
+
+    void insert(std::int64_t key, const unsigned char* data, std::size_t size) {
+        c_.insert(key, data, size);
     }
-    return keys;
-}
+    void insert(const unsigned char* key, std::size_t keySize, const unsigned char* data,
+                std::size_t size) {
+        c_.insert(key, keySize, data, size);
+    }
+
+    bool step(bool started) { return started ? c_.next() : c_.first(); }
+    void readEntry(std::vector<unsigned char>& /*keyBuf: the key goes to a string*/,
+                   std::vector<unsigned char>& dataBuf, Tally& tally) {
+        // The whole key: the public fetch with an empty prefix.
+        c_.indexKeyFetch("", 0, key_);
+        auto dataSize = static_cast<std::uint64_t>(c_.dataSize());
+        if (dataSize > dataBuf.size()) {
+            throw std::runtime_error("store scan: entry larger than expected");
+        }
+        c_.data(dataBuf.data(), dataSize);
+        tally.add(reinterpret_cast<const unsigned char*>(key_.data()), key_.size(), dataBuf.data());
+    }
+
+    void seekEntry(const Key16& key, std::vector<unsigned char>& buffer, Tally& tally) {
+        if (c_.seek(key.data(), key.size()) != 0) {
+            return;
+        }
+        auto dataSize = static_cast<std::uint64_t>(c_.dataSize());
+        if (dataSize < 8 || dataSize > buffer.size()) {
+            return;
+        }
+        c_.data(buffer.data(), dataSize);
+        tally.add(key.data(), key.size(), buffer.data());
+    }
+
+  private:
+    KovBtreeCursor c_;
+    std::string key_;
+};
 
 // The N composite keys, in insertion order: the prefix of a random group,
 // then a random payload.
@@ -89,8 +125,8 @@ struct CompositeKeys {
 const CompositeKeys& compositeKeys(std::size_t n) {
     static CompositeKeys c;
     if (c.keys.size() != n) {
-        c.prefixes = kov::bench::randomKeys(kGroups, 0x67726f7570);
-        kov::bench::Random random(0x7061796c6f6164);
+        c.prefixes = kov::bench::randomKeys(kGroups, kov::bench::kGroupPrefixSeed);
+        kov::bench::Random random(kov::bench::kPayloadSeed);
         c.keys.resize(n);
         for (Key16& k : c.keys) {
             const Key16& prefix = c.prefixes[random.below(kGroups)];
@@ -117,26 +153,59 @@ const CompositeKeys& compositeKeys(std::size_t n) {
 std::unique_ptr<BlobPair> gRandomSet;
 std::unique_ptr<KeyPair> gCompositeSet;
 
-void fillRandom(BlobPair& set, std::size_t n) {
-    const std::vector<Key16>& keys = workloadKeys(n);
-    Payload data;
-    KovBtreeCursor cursor(set.table, true);
-    for (std::size_t i = 0; i < n; ++i) {
-        set.rawTable.insert(keys[i].data(), keys[i].size(), data.forEntry(i), kDataSize);
-        cursor.insert(keys[i].data(), keys[i].size(), data.forEntry(i), kDataSize);
-    }
-}
+// The store's public classes as the measured side of the shared workloads
+// (bench/paired_workloads.h).
+struct StoreSide {
+    static constexpr char kName[] = "store";
 
-BlobPair& randomSet(std::size_t n) {
-    static std::size_t size = 0;
-    if (gRandomSet == nullptr || size != n) {
-        gRandomSet.reset();
-        gRandomSet = std::make_unique<BlobPair>(KovBtree::BlobTable);
-        fillRandom(*gRandomSet, n);
-        size = n;
+    using BlobSet = BlobPair;
+    using Cursor = StoreCursor;
+
+    // A raw integer-keyed table and a store one.
+    struct IntSet : TablePair<RawIntTable> {
+        IntSet() : TablePair(KovBtree::IntKeyTable) {}
+        StoreCursor cursor{table};
+
+        // A cheap check that the store took every entry.
+        void checkFilled(std::size_t n) {
+            std::int64_t lastKey = -1;
+            if (cursor.get().last()) {
+                cursor.get().key(lastKey);
+            }
+            if (lastKey != static_cast<std::int64_t>(n - 1)) {
+                throw std::runtime_error("store: the last inserted key is missing");
+            }
+        }
+    };
+
+    static std::unique_ptr<BlobPair> newBlobSet() {
+        return std::make_unique<BlobPair>(KovBtree::BlobTable);
     }
-    return *gRandomSet;
-}
+
+    static BlobPair& randomSet(std::size_t n) {
+        static std::size_t size = 0;
+        if (gRandomSet == nullptr || size != n) {
+            gRandomSet.reset();
+            gRandomSet = newBlobSet();
+            const std::vector<Key16>& keys = kov::bench::workloadKeys(n);
+            Payload data;
+            StoreCursor cursor(*gRandomSet);
+            for (std::size_t i = 0; i < n; ++i) {
+                gRandomSet->rawTable.insert(keys[i].data(), keys[i].size(), data.forEntry(i),
+                                            kDataSize);
+                cursor.insert(keys[i].data(), keys[i].size(), data.forEntry(i), kDataSize);
+            }
+            size = n;
+        }
+        return *gRandomSet;
+    }
+    // Kept without its size: randomSet still fills a set of its own on its
+    // first call.
+    static void keepRandomSet(std::unique_ptr<BlobPair> set, std::size_t /*n*/) {
+        gRandomSet = std::move(set);
+    }
+    static void dropRandomSet() { gRandomSet.reset(); }
+};
 
 KeyPair& compositeSet(std::size_t n) {
     static std::size_t size = 0;
@@ -154,234 +223,40 @@ KeyPair& compositeSet(std::size_t n) {
     return *gCompositeSet;
 }
 
-void BM_SeqIntInsert(benchmark::State& state) {
-    const auto n = static_cast<std::size_t>(state.range(0));
-    PairTimer timer;
-    Payload rawData;
-    Payload storeData;
-    try {
-        for (auto _ : state) {
-            TablePair<RawIntTable> set(KovBtree::IntKeyTable);
-            KovBtreeCursor cursor(set.table, true);
-            timer.run(
-                n, kInsertChunk,
-                [&](std::size_t begin, std::size_t end) {
-                    for (std::size_t i = begin; i < end; ++i) {
-                        set.rawTable.insert(static_cast<std::int64_t>(i), rawData.forEntry(i),
-                                            kDataSize);
-                    }
-                },
-                [&](std::size_t begin, std::size_t end) {
-                    for (std::size_t i = begin; i < end; ++i) {
-                        cursor.insert(static_cast<std::int64_t>(i), storeData.forEntry(i),
-                                      kDataSize);
-                    }
-                });
-            state.SetIterationTime(timer.takeMeasuredWallSeconds());
-            // A cheap check that the store took every entry.
-            std::int64_t lastKey = -1;
-            if (cursor.last()) {
-                cursor.key(lastKey);
-            }
-            if (lastKey != static_cast<std::int64_t>(n - 1)) {
-                throw std::runtime_error("store: the last inserted key is missing");
-            }
-        }
-    } catch (const std::exception& e) {
-        state.SkipWithError(e.what());
-        return;
-    }
-    kov::bench::setPairCounters(state, timer, "store");
-}
-
-void BM_RandomBlobInsert(benchmark::State& state) {
-    const auto n = static_cast<std::size_t>(state.range(0));
-    const std::vector<Key16>& keys = workloadKeys(n);
-    PairTimer timer;
-    Payload rawData;
-    Payload storeData;
-    try {
-        for (auto _ : state) {
-            // Drop the kept tables first (no cursor is open, so the store
-            // really drops its table).
-            gRandomSet.reset();
-            auto set = std::make_unique<BlobPair>(KovBtree::BlobTable);
-            {
-                KovBtreeCursor cursor(set->table, true);
-                timer.run(
-                    n, kInsertChunk,
-                    [&](std::size_t begin, std::size_t end) {
-                        for (std::size_t i = begin; i < end; ++i) {
-                            set->rawTable.insert(keys[i].data(), keys[i].size(),
-                                                 rawData.forEntry(i), kDataSize);
-                        }
-                    },
-                    [&](std::size_t begin, std::size_t end) {
-                        for (std::size_t i = begin; i < end; ++i) {
-                            cursor.insert(keys[i].data(), keys[i].size(), storeData.forEntry(i),
-                                          kDataSize);
-                        }
-                    });
-            }
-            state.SetIterationTime(timer.takeMeasuredWallSeconds());
-            gRandomSet = std::move(set);
-        }
-    } catch (const std::exception& e) {
-        state.SkipWithError(e.what());
-        return;
-    }
-    kov::bench::setPairCounters(state, timer, "store");
-}
-
-void BM_OrderedScan(benchmark::State& state) {
-    const auto n = static_cast<std::size_t>(state.range(0));
-    PairTimer timer;
-    std::vector<unsigned char> keyBuf(4096);
-    std::vector<unsigned char> dataBuf(4096);
-    std::string storeKey;
-    try {
-        BlobPair& set = randomSet(n);
-        KovBtreeCursor cursor(set.table, true);
-        for (auto _ : state) {
-            Tally raw;
-            Tally store;
-            bool storeStarted = false;
-            kov::bench::RawScan& scan = set.rawTable.scan();
-            timer.run(
-                n, kScanChunk,
-                [&](std::size_t begin, std::size_t end) {
-                    scan.copyRows(end - begin, keyBuf, dataBuf,
-                                  [&](const unsigned char* key, std::size_t keySize,
-                                      const unsigned char* data) { raw.add(key, keySize, data); });
-                },
-                [&](std::size_t begin, std::size_t end) {
-                    for (std::size_t i = begin; i < end; ++i) {
-                        bool on = storeStarted ? cursor.next() : cursor.first();
-                        storeStarted = true;
-                        if (!on) {
-                            break;
-                        }
-                        // The whole key: the public fetch with an empty prefix.
-                        cursor.indexKeyFetch("", 0, storeKey);
-                        auto dataSize = static_cast<std::uint64_t>(cursor.dataSize());
-                        if (dataSize > dataBuf.size()) {
-                            throw std::runtime_error("store scan: entry larger than expected");
-                        }
-                        cursor.data(dataBuf.data(), dataSize);
-                        store.add(reinterpret_cast<const unsigned char*>(storeKey.data()),
-                                  storeKey.size(), dataBuf.data());
-                    }
-                });
-            scan.reset();
-            state.SetIterationTime(timer.takeMeasuredWallSeconds());
-            if (raw.rows != n || !(raw == store)) {
-                throw std::runtime_error("scan: the two sides read different entries");
-            }
-        }
-    } catch (const std::exception& e) {
-        state.SkipWithError(e.what());
-        return;
-    }
-    kov::bench::setPairCounters(state, timer, "store");
-}
-
-void BM_RandomSeek(benchmark::State& state) {
-    const auto n = static_cast<std::size_t>(state.range(0));
-    const std::size_t seeks = n / 10;
-    const std::vector<Key16>& keys = workloadKeys(n);
-    const std::vector<std::size_t> order = kov::bench::randomIndices(seeks, n, 0x7365656b);
-    PairTimer timer;
-    std::vector<unsigned char> rawBuf(4096);
-    std::vector<unsigned char> storeBuf(4096);
-    try {
-        BlobPair& set = randomSet(n);
-        KovBtreeCursor cursor(set.table, true);
-        for (auto _ : state) {
-            Tally raw;
-            Tally store;
-            timer.run(
-                seeks, kSeekChunk,
-                [&](std::size_t begin, std::size_t end) {
-                    for (std::size_t i = begin; i < end; ++i) {
-                        const Key16& key = keys[order[i]];
-                        if (set.rawTable.seekData(key.data(), key.size(), rawBuf.data(),
-                                                  rawBuf.size()) >= 8) {
-                            raw.add(key.data(), key.size(), rawBuf.data());
-                        }
-                    }
-                },
-                [&](std::size_t begin, std::size_t end) {
-                    for (std::size_t i = begin; i < end; ++i) {
-                        const Key16& key = keys[order[i]];
-                        if (cursor.seek(key.data(), key.size()) != 0) {
-                            continue;
-                        }
-                        auto dataSize = static_cast<std::uint64_t>(cursor.dataSize());
-                        if (dataSize < 8 || dataSize > storeBuf.size()) {
-                            continue;
-                        }
-                        cursor.data(storeBuf.data(), dataSize);
-                        store.add(key.data(), key.size(), storeBuf.data());
-                    }
-                });
-            state.SetIterationTime(timer.takeMeasuredWallSeconds());
-            if (raw.rows != seeks || !(raw == store)) {
-                throw std::runtime_error("seek: the two sides found different entries");
-            }
-        }
-    } catch (const std::exception& e) {
-        state.SkipWithError(e.what());
-        return;
-    }
-    kov::bench::setPairCounters(state, timer, "store");
-}
-
 void BM_CompositeInsert(benchmark::State& state) {
     const auto n = static_cast<std::size_t>(state.range(0));
     const std::vector<Key16>& keys = compositeKeys(n).keys;
-    PairTimer timer;
-    try {
+    kov::bench::runPaired(state, StoreSide::kName, [&](PairedRun& run) {
         for (auto _ : state) {
             gCompositeSet.reset();
             auto set = std::make_unique<KeyPair>(KovBtree::IndexTable);
             {
                 KovBtreeCursor cursor(set->table, true);
-                timer.run(
-                    n, kInsertChunk,
-                    [&](std::size_t begin, std::size_t end) {
-                        for (std::size_t i = begin; i < end; ++i) {
-                            set->rawTable.insert(keys[i].data(), keys[i].size());
-                        }
-                    },
-                    [&](std::size_t begin, std::size_t end) {
-                        for (std::size_t i = begin; i < end; ++i) {
-                            cursor.insert(keys[i].data(), keys[i].size());
-                        }
-                    });
+                run.sides(n, kov::bench::kInsertChunk,
+                          kov::bench::rawKeyInserts(set->rawTable, keys),
+                          [&](std::size_t begin, std::size_t end) {
+                              for (std::size_t i = begin; i < end; ++i) {
+                                  cursor.insert(keys[i].data(), keys[i].size());
+                              }
+                          });
             }
-            state.SetIterationTime(timer.takeMeasuredWallSeconds());
             gCompositeSet = std::move(set);
         }
-    } catch (const std::exception& e) {
-        state.SkipWithError(e.what());
-        return;
-    }
-    kov::bench::setPairCounters(state, timer, "store");
+    });
 }
 
 void BM_PrefixWalk(benchmark::State& state) {
     const auto n = static_cast<std::size_t>(state.range(0));
     const CompositeKeys& c = compositeKeys(n);
-    PairTimer timer;
-    std::vector<unsigned char> rawPayload(64);
-    std::string storePayload;
-    try {
+    kov::bench::runPaired(state, StoreSide::kName, [&](PairedRun& run) {
+        std::vector<unsigned char> rawPayload(64);
+        std::string storePayload;
         KeyPair& set = compositeSet(n);
         KovBtreeCursor cursor(set.table, true);
         for (auto _ : state) {
             Tally raw;
             Tally store;
-            timer.run(
+            run.sides(
                 kGroups, kWalkChunk,
                 [&](std::size_t begin, std::size_t end) {
                     for (std::size_t g = begin; g < end; ++g) {
@@ -413,50 +288,26 @@ void BM_PrefixWalk(benchmark::State& state) {
                     }
                 },
                 c.distinct);
-            state.SetIterationTime(timer.takeMeasuredWallSeconds());
-            if (raw.rows != c.distinct || !(raw == store)) {
-                throw std::runtime_error("walk: the two sides walked different entries");
-            }
+            kov::bench::checkTallies(raw, store, c.distinct,
+                                     "walk: the two sides walked different entries");
         }
-    } catch (const std::exception& e) {
-        state.SkipWithError(e.what());
-        return;
-    }
-    kov::bench::setPairCounters(state, timer, "store");
+    });
 }
 
 }  // namespace
 
 int main(int argc, char** argv) {
-    const std::int64_t n = kov::bench::takeWorkloadSize(&argc, argv);
-    benchmark::Initialize(&argc, argv);
-    if (benchmark::ReportUnrecognizedArguments(argc, argv)) {
+    std::int64_t n = 0;
+    if (!kov::bench::initialize(&argc, argv, &n)) {
         return 1;
     }
     // The store first: it points SQLite at its temporary directory, so the
     // raw databases' files land in the same place.
     KovPager::instance();
-    const struct {
-        const char* name;
-        void (*fn)(benchmark::State&);
-        int iterations;
-    } workloads[] = {
-        {"BM_SeqIntInsert", BM_SeqIntInsert, 3},
-        {"BM_RandomBlobInsert", BM_RandomBlobInsert, 2},
-        {"BM_OrderedScan", BM_OrderedScan, 5},
-        {"BM_RandomSeek", BM_RandomSeek, 5},
-        {"BM_CompositeInsert", BM_CompositeInsert, 2},
-        {"BM_PrefixWalk", BM_PrefixWalk, 5},
-    };
-    for (const auto& w : workloads) {
-        benchmark::RegisterBenchmark(w.name, w.fn)
-            ->Arg(n)
-            ->Iterations(w.iterations)
-            ->UseManualTime()
-            ->Unit(benchmark::kMillisecond);
-    }
-    benchmark::RunSpecifiedBenchmarks();
-    benchmark::Shutdown();
+    std::vector<kov::bench::PairedWorkload> workloads = kov::bench::sharedWorkloads<StoreSide>();
+    workloads.push_back({"BM_CompositeInsert", BM_CompositeInsert, 2});
+    workloads.push_back({"BM_PrefixWalk", BM_PrefixWalk, 5});
+    kov::bench::runWorkloads(n, workloads);
     // Tables go before the store's exit-time teardown closes the engine.
     gRandomSet.reset();
     gCompositeSet.reset();
