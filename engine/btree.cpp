@@ -429,14 +429,27 @@ int sqlite3BtreeIntegrityCheck(Btree* p, int maxErrors, int* pnErr, std::string*
     return SQLITE_OK;
 }
 
-int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags) {
-    if (p == nullptr || piTable == nullptr)
-        return SQLITE_MISUSE;
+namespace {
+
+// SQLITE_OK when a table may be created or dropped now; else why not: SQLITE_LOCKED while a
+// cursor is open (the change may move pages under it), SQLITE_ERROR outside a writable
+// transaction.
+int tableChangeRefused(Btree* p) {
     checkEngine(p);
     if (p->openCursors > 0)
         return SQLITE_LOCKED;
     if (p->transaction != Transaction::Write || !p->writable)
         return SQLITE_ERROR;
+    return SQLITE_OK;
+}
+
+}  // namespace
+
+int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags) {
+    if (p == nullptr || piTable == nullptr)
+        return SQLITE_MISUSE;
+    if (int refused = tableChangeRefused(p))
+        return refused;
 
     auto t = std::make_unique<Table>();
     t->intKey = (flags & BTREE_INTKEY) != 0;
@@ -454,11 +467,8 @@ int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags) {
 int sqlite3BtreeDropTable(Btree* p, std::uint32_t iTable, int* piMoved) {
     if (p == nullptr || piMoved == nullptr)
         return SQLITE_MISUSE;
-    checkEngine(p);
-    if (p->openCursors > 0)
-        return SQLITE_LOCKED;
-    if (p->transaction != Transaction::Write || !p->writable)
-        return SQLITE_ERROR;
+    if (int refused = tableChangeRefused(p))
+        return refused;
     auto found = p->tables.find(iTable);
     if (found == p->tables.end())
         return SQLITE_ERROR;

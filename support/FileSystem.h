@@ -13,6 +13,7 @@
 #include <cstdint>
 #include <fstream>
 #include <ios>
+#include <new>
 #include <string>
 #include <vector>
 
@@ -74,6 +75,15 @@ class FileSystem {
 
 // The host's file system (never null).
 FileSystem& hostFileSystem();
+
+// The one object of type T, built on first use in static storage and never destroyed, so that
+// code running at exit may still use it: each platform's hostFileSystem() returns one.
+template <class T>
+T& everlasting() {
+    alignas(T) static unsigned char storage[sizeof(T)];
+    static T* instance = new (storage) T;
+    return *instance;
+}
 
 // The instance the file objects use: the host's unless a test replaced it.
 FileSystem& fileSystem();

@@ -9,7 +9,6 @@
 #include <cerrno>
 #include <cstdio>
 #include <ctime>
-#include <new>
 
 #include "support/FileSystem.h"
 
@@ -178,11 +177,7 @@ class PosixFileSystem final : public FileSystem {
 }  // namespace
 
 FileSystem& hostFileSystem() {
-    // Built on first use in static storage and never destroyed, so that code
-    // running at exit may still use it.
-    alignas(PosixFileSystem) static unsigned char storage[sizeof(PosixFileSystem)];
-    static FileSystem* instance = new (storage) PosixFileSystem;
-    return *instance;
+    return everlasting<PosixFileSystem>();
 }
 
 }  // namespace kov::fs

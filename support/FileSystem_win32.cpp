@@ -1,13 +1,7 @@
 // The file system on Windows: every path is converted from UTF-8 to UTF-16
 // (lossily, so an undecodable name never fails the conversion) and handed
 // to the wide calls of the C runtime and of Win32.
-#ifndef WIN32_LEAN_AND_MEAN
-#define WIN32_LEAN_AND_MEAN
-#endif
-#ifndef NOMINMAX
-#define NOMINMAX
-#endif
-#include <windows.h>
+#include "support/Win32Api.h"
 
 #include <direct.h>
 #include <io.h>
@@ -17,7 +11,6 @@
 #include <wchar.h>
 
 #include <filesystem>
-#include <new>
 
 #include "support/FileSystem.h"
 #include "support/Text.h"
@@ -160,11 +153,7 @@ class Win32FileSystem final : public FileSystem {
 }  // namespace
 
 FileSystem& hostFileSystem() {
-    // Built on first use in static storage and never destroyed, so that code
-    // running at exit may still use it.
-    alignas(Win32FileSystem) static unsigned char storage[sizeof(Win32FileSystem)];
-    static FileSystem* instance = new (storage) Win32FileSystem;
-    return *instance;
+    return everlasting<Win32FileSystem>();
 }
 
 }  // namespace kov::fs

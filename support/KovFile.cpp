@@ -261,6 +261,19 @@ bool KovFile::copyTo(const std::string& destination, bool overwrite) {
     return copyTo(Utf8Text(kov::text::narrowToUtf8Lossy(destination)), overwrite);
 }
 
+namespace {
+
+// Whether a copy or a move may write `target`: it names a path, and that path is missing or may
+// be overwritten.
+bool mayBeWritten(KovFile& target, bool overwrite) {
+    if (!target.info())
+        return false;
+    target.refresh(false);
+    return overwrite || !target.info()->exists_;
+}
+
+}  // namespace
+
 bool KovFile::copyTo(const Utf8Text& destination, bool overwrite) {
     if (!exists())
         return false;
@@ -269,10 +282,7 @@ bool KovFile::copyTo(const Utf8Text& destination, bool overwrite) {
         return asDirectory.copyTo(destination, overwrite);
     }
     KovFile target(destination, info_->caseMode_, false);
-    if (!target.info_)
-        return false;
-    target.refresh(false);
-    if (target.info_->exists_ && !overwrite)
+    if (!mayBeWritten(target, overwrite))
         return false;
     if (std::unique_ptr<KovDirectory> parent = target.parentDirectory())
         parent->create();
@@ -293,10 +303,7 @@ bool KovFile::moveTo(const Utf8Text& destination, bool overwrite) {
     if (isChainRoot() || !exists())
         return false;
     KovFile target(destination, info_->caseMode_, false);
-    if (!target.info_)
-        return false;
-    target.refresh(false);
-    if (target.info_->exists_ && !overwrite)
+    if (!mayBeWritten(target, overwrite))
         return false;
     if (!ensureStat())
         return false;

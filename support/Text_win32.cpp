@@ -2,13 +2,7 @@
 // MultiByteToWideChar / WideCharToMultiByte. The strict forms refuse
 // characters the code page cannot hold; the lossy forms let Windows put its
 // default character in their place.
-#ifndef WIN32_LEAN_AND_MEAN
-#define WIN32_LEAN_AND_MEAN
-#endif
-#ifndef NOMINMAX
-#define NOMINMAX
-#endif
-#include <windows.h>
+#include "support/Win32Api.h"
 
 #include <climits>
 

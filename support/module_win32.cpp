@@ -6,7 +6,7 @@
 // and every mingw-w64 DLL carries a TLS directory for its C runtime, so the
 // call returns FALSE there and the notifications keep coming. That is
 // harmless: this entry point does nothing with them.
-#include <windows.h>
+#include "support/Win32Api.h"
 
 extern "C" BOOL WINAPI DllMain(HINSTANCE module, DWORD reason, LPVOID /*reserved*/) {
     if (reason == DLL_PROCESS_ATTACH) DisableThreadLibraryCalls(module);

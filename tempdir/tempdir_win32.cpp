@@ -3,8 +3,8 @@
 // %KOV_TEMP%, %TEMP%, %TMP%, then the user's local application-data folder followed by "/Temp",
 // then "c:/temp", then "c:/tmp" (created when missing). The shell folder is asked for only when the
 // search reaches it, and is asked not to create the folder.
-// windows.h first: shlobj.h needs its types.
-#include <windows.h>
+// Win32Api.h first: shlobj.h needs the types of windows.h.
+#include "support/Win32Api.h"
 
 #include <shlobj.h>
 

@@ -6,6 +6,7 @@
 # objdump defaults to x86_64-w64-mingw32-objdump; the demangler is the
 # c++filt beside it (x86_64-w64-mingw32-c++filt), else the host's c++filt.
 set -eu
+. "$(dirname "$0")/exports_lib.sh"
 dll=$1
 objdump=${2:-x86_64-w64-mingw32-objdump}
 cxxfilt=$(printf '%s' "$objdump" | sed 's/objdump$/c++filt/')
@@ -29,14 +30,4 @@ if [ -n "$engine" ]; then
 fi
 
 symbols=$(printf '%s\n' "$raw" | "$cxxfilt")
-stray=$(printf '%s\n' "$symbols" | grep -v -E '^(KovPager|KovBtree|KovBtreeCursor)::' || true)
-classes=$(printf '%s\n' "$symbols" | grep -c -E '^(KovPager|KovBtree|KovBtreeCursor)::' || true)
-if [ -n "$stray" ]; then
-    echo "names exported outside the three classes:" >&2
-    printf '%s\n' "$stray" >&2
-    exit 1
-fi
-for class in KovPager KovBtree KovBtreeCursor; do
-    printf '%s\n' "$symbols" | grep -q -E "^$class::" || { echo "$class exports nothing" >&2; exit 1; }
-done
-echo "$classes names exported, all members of the three classes"
+only_class_members "$symbols" names

@@ -16,13 +16,7 @@
 //       is empty.
 //
 // The process ends with 0 when every check held, 1 (with a message on stderr) otherwise.
-#ifndef WIN32_LEAN_AND_MEAN
-#define WIN32_LEAN_AND_MEAN
-#endif
-#ifndef NOMINMAX
-#define NOMINMAX
-#endif
-#include <windows.h>
+#include "support/Win32Api.h"
 
 #include <cstdint>
 #include <cstdio>
@@ -30,7 +24,14 @@
 #include <string>
 #include <vector>
 
+#include "host_util.h"
+
 namespace {
+
+using kov::test::check;
+using kov::test::entriesOf;
+using kov::test::joined;
+using kov::test::scratchDir;
 
 constexpr std::int64_t kRecordSize = 1024;
 constexpr std::int64_t kBatch = 1000;
@@ -40,43 +41,6 @@ constexpr std::int64_t kPastTheCache = 80000;  // 80 MiB of data: past the 64 Mi
 constexpr const char* kPagerInstance = "_ZN8KovPager8instanceEv";
 constexpr const char* kTableConstructor = "_ZN8KovBtreeC1ENS_9TableTypeE";
 constexpr const char* kCursorInsert = "_ZN14KovBtreeCursor6insertExPKvy";
-
-int gFailures = 0;
-
-void check(bool ok, const std::string& what) {
-    if (!ok) {
-        std::fprintf(stderr, "dll_host_win32: check failed: %s\n", what.c_str());
-        ++gFailures;
-    }
-}
-
-std::string scratchDir() {
-    const char* dir = std::getenv("KOV_TEMP");
-    return dir != nullptr ? std::string(dir) : std::string();
-}
-
-// The names in `dir`, without "." and "..".
-std::vector<std::string> entriesOf(const std::string& dir) {
-    std::vector<std::string> names;
-    WIN32_FIND_DATAA found;
-    const HANDLE h = FindFirstFileA((dir + "\\*").c_str(), &found);
-    if (h == INVALID_HANDLE_VALUE)
-        return names;
-    do {
-        const std::string name = found.cFileName;
-        if (name != "." && name != "..")
-            names.push_back(name);
-    } while (FindNextFileA(h, &found));
-    FindClose(h);
-    return names;
-}
-
-std::string joined(const std::vector<std::string>& names) {
-    std::string out;
-    for (const std::string& name : names)
-        out += (out.empty() ? "" : ", ") + name;
-    return out;
-}
 
 // The final name of a path ("libkovpager.dll" of "..\libkovpager.dll").
 std::string baseName(const std::string& path) {
@@ -113,7 +77,7 @@ int loadOnly(const std::string& library) {
     check(!isLoaded(name), name + " unloaded");
     const std::vector<std::string> left = entriesOf(scratchDir());
     check(left.empty(), "nothing created in KOV_TEMP: " + joined(left));
-    return gFailures == 0 ? 0 : 1;
+    return kov::test::gHostFailures == 0 ? 0 : 1;
 }
 
 int instanceByName(const std::string& library) {
@@ -135,7 +99,7 @@ int instanceByName(const std::string& library) {
     check(!isLoaded(name), name + " unloaded");
     const std::vector<std::string> left = entriesOf(scratchDir());
     check(left.empty(), "nothing left in KOV_TEMP: " + joined(left));
-    return gFailures == 0 ? 0 : 1;
+    return kov::test::gHostFailures == 0 ? 0 : 1;
 }
 
 int useAndUnload(const std::string& plugin, const std::string& libraryDir,
@@ -179,7 +143,7 @@ int useAndUnload(const std::string& plugin, const std::string& libraryDir,
     check(!isLoaded(libraryName), libraryName + " is unloaded with the plugin");
     const std::vector<std::string> left = entriesOf(dir);
     check(left.empty(), "KOV_TEMP is empty after unload: " + joined(left));
-    return gFailures == 0 ? 0 : 1;
+    return kov::test::gHostFailures == 0 ? 0 : 1;
 }
 
 }  // namespace

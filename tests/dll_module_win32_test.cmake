@@ -3,6 +3,8 @@
 #   dll_host_win32_plugin  a DLL that links the store's DLL and fills the store.
 # The test program finds them, and the store's DLL, relative to its own directory.
 add_executable(dll_host_win32 "${CMAKE_CURRENT_SOURCE_DIR}/dll_host_win32.cpp")
+# support/Win32Api.h only: the host never links the store.
+target_include_directories(dll_host_win32 PRIVATE "${PROJECT_SOURCE_DIR}")
 kovpager_warnings(dll_host_win32)
 
 add_library(dll_host_win32_plugin MODULE "${CMAKE_CURRENT_SOURCE_DIR}/module_plugin.cpp")

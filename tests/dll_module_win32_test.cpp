@@ -6,13 +6,7 @@
 //
 // The paths of the DLL, the host and its plugin are given relative to this program's own
 // directory (KOV_LIBRARY_FROM_TESTS, KOV_DLL_HOST, KOV_DLL_PLUGIN).
-#ifndef WIN32_LEAN_AND_MEAN
-#define WIN32_LEAN_AND_MEAN
-#endif
-#ifndef NOMINMAX
-#define NOMINMAX
-#endif
-#include <windows.h>
+#include "support/Win32Api.h"
 
 #include <winternl.h>
 
@@ -24,6 +18,8 @@
 #include <string>
 #include <thread>
 #include <vector>
+
+#include "host_util.h"
 
 namespace {
 
@@ -197,20 +193,7 @@ class ScratchDirectory {
 
     const std::string& path() const { return path_; }
 
-    std::vector<std::string> entries() const {
-        std::vector<std::string> names;
-        WIN32_FIND_DATAA found;
-        const HANDLE h = FindFirstFileA((path_ + "\\*").c_str(), &found);
-        if (h == INVALID_HANDLE_VALUE)
-            return names;
-        do {
-            const std::string name = found.cFileName;
-            if (name != "." && name != "..")
-                names.push_back(name);
-        } while (FindNextFileA(h, &found));
-        FindClose(h);
-        return names;
-    }
+    std::vector<std::string> entries() const { return kov::test::entriesOf(path_); }
 
   private:
     std::string path_;

@@ -27,39 +27,17 @@
 #include <string>
 #include <vector>
 
+#include "host_util.h"
+
 namespace {
+
+using kov::test::check;
+using kov::test::entriesOf;
+using kov::test::scratchDir;
 
 constexpr std::int64_t kRecordSize = 1024;
 constexpr std::int64_t kBatch = 1000;
 constexpr std::int64_t kPastTheCache = 80000;  // 80 MiB of data: past the 64 MiB page cache
-
-int gFailures = 0;
-
-void check(bool ok, const std::string& what) {
-    if (!ok) {
-        std::fprintf(stderr, "module_host: check failed: %s\n", what.c_str());
-        ++gFailures;
-    }
-}
-
-std::string scratchDir() {
-    const char* dir = std::getenv("KOV_TEMP");
-    return dir != nullptr ? std::string(dir) : std::string();
-}
-
-// The names in `dir`, without "." and "..".
-std::vector<std::string> entriesOf(const std::string& dir) {
-    std::vector<std::string> names;
-    if (DIR* d = opendir(dir.c_str())) {
-        while (dirent* e = readdir(d)) {
-            const std::string name = e->d_name;
-            if (name != "." && name != "..")
-                names.push_back(name);
-        }
-        closedir(d);
-    }
-    return names;
-}
 
 // The targets of this process's open descriptors.
 std::vector<std::string> openFiles() {
@@ -180,7 +158,7 @@ int loadOnly(const char* library) {
     check(dlopen(library, RTLD_NOW | RTLD_NOLOAD) == nullptr, "library unloaded by dlclose");
     checkNothingLeft("after unload");
     std::printf("unloaded\n");
-    return gFailures == 0 ? 0 : 1;
+    return kov::test::gHostFailures == 0 ? 0 : 1;
 }
 
 int useAndUnload(const char* pluginPath, const char* soname) {
@@ -199,7 +177,7 @@ int useAndUnload(const char* pluginPath, const char* soname) {
     check(dlopen(soname, RTLD_NOW | RTLD_NOLOAD) == nullptr, "library unloaded with the plugin");
     checkNothingLeft("after unload");
     std::printf("unloaded\n");
-    return gFailures == 0 ? 0 : 1;
+    return kov::test::gHostFailures == 0 ? 0 : 1;
 }
 
 int useAndExit(const char* pluginPath) {
@@ -209,7 +187,7 @@ int useAndExit(const char* pluginPath) {
     check(plugin.verify() == inserted, "every record reads back as written");
     checkSpillFile();
     // The table and its cursor stay alive; exit closes the engine.
-    return gFailures == 0 ? 0 : 1;
+    return kov::test::gHostFailures == 0 ? 0 : 1;
 }
 
 int loadForever(const char* pluginPath) {

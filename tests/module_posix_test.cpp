@@ -27,6 +27,7 @@
 #include <vector>
 
 #include "engine/btree.h"
+#include "host_util.h"
 #include "kov_test_access.h"
 #include "pager_test_util.h"
 #include "support/FileSystem.h"
@@ -47,28 +48,10 @@ extern "C" int __wrap_atexit(void (*function)()) {
 namespace {
 
 using namespace kovtest;
+using kov::test::entriesOf;
+using kov::test::joined;
 
 // --- scratch directories and processes ---
-
-std::vector<std::string> entriesOf(const std::string& dir) {
-    std::vector<std::string> names;
-    if (DIR* d = opendir(dir.c_str())) {
-        while (dirent* e = readdir(d)) {
-            const std::string name = e->d_name;
-            if (name != "." && name != "..")
-                names.push_back(name);
-        }
-        closedir(d);
-    }
-    return names;
-}
-
-std::string join(const std::vector<std::string>& names) {
-    std::string out;
-    for (const std::string& n : names)
-        out += (out.empty() ? "" : ", ") + n;
-    return out;
-}
 
 // A fresh, empty directory for one test's KOV_TEMP; removed (with whatever a failing test left in
 // it) at the end of the test.
@@ -327,39 +310,32 @@ TEST(ModuleLibrary, IsNeitherNodeleteNorPinnedByUniqueSymbols) {
     EXPECT_EQ(out.find("UNIQUE"), std::string::npos) << out;
 }
 
-TEST(ModuleLibrary, LoadAndUnloadWithoutUseCreatesNothing) {
+// Runs the host with `arguments` and a fresh scratch directory as its KOV_TEMP: it must exit
+// with 0 after printing each of `printed`, and leave the directory empty.
+static void expectHostLeavesNothing(const std::vector<std::string>& arguments,
+                             const std::vector<std::string>& printed) {
     Scratch scratch;
     ASSERT_FALSE(scratch.path().empty());
     int status = 0;
-    const std::string out = runHost({"load-only", KOV_LIBRARY}, scratch.path(), status);
+    const std::string out = runHost(arguments, scratch.path(), status);
     ASSERT_TRUE(WIFEXITED(status)) << status;
     EXPECT_EQ(WEXITSTATUS(status), 0) << out;
-    EXPECT_NE(out.find("unloaded"), std::string::npos) << out;
-    EXPECT_TRUE(entriesOf(scratch.path()).empty()) << join(entriesOf(scratch.path()));
+    for (const std::string& word : printed)
+        EXPECT_NE(out.find(word), std::string::npos) << word << " in " << out;
+    EXPECT_TRUE(entriesOf(scratch.path()).empty()) << joined(entriesOf(scratch.path()));
+}
+
+TEST(ModuleLibrary, LoadAndUnloadWithoutUseCreatesNothing) {
+    expectHostLeavesNothing({"load-only", KOV_LIBRARY}, {"unloaded"});
 }
 
 TEST(ModuleLibrary, UnloadAfterUsePastTheCacheClosesTheEngineAndLeavesNothing) {
-    Scratch scratch;
-    ASSERT_FALSE(scratch.path().empty());
-    int status = 0;
-    const std::string out =
-        runHost({"use-and-unload", KOV_MODULE_PLUGIN, KOV_LIBRARY_SONAME}, scratch.path(), status);
-    ASSERT_TRUE(WIFEXITED(status)) << status;
-    EXPECT_EQ(WEXITSTATUS(status), 0) << out;
-    EXPECT_NE(out.find("spilled"), std::string::npos) << out;
-    EXPECT_NE(out.find("unloaded"), std::string::npos) << out;
-    EXPECT_TRUE(entriesOf(scratch.path()).empty()) << join(entriesOf(scratch.path()));
+    expectHostLeavesNothing({"use-and-unload", KOV_MODULE_PLUGIN, KOV_LIBRARY_SONAME},
+                            {"spilled", "unloaded"});
 }
 
 TEST(ModuleExit, ProcessThatExitsAfterUseLeavesItsTemporaryDirectoryEmpty) {
-    Scratch scratch;
-    ASSERT_FALSE(scratch.path().empty());
-    int status = 0;
-    const std::string out = runHost({"use-and-exit", KOV_MODULE_PLUGIN}, scratch.path(), status);
-    ASSERT_TRUE(WIFEXITED(status)) << status;
-    EXPECT_EQ(WEXITSTATUS(status), 0) << out;
-    EXPECT_NE(out.find("spilled"), std::string::npos) << out;
-    EXPECT_TRUE(entriesOf(scratch.path()).empty()) << join(entriesOf(scratch.path()));
+    expectHostLeavesNothing({"use-and-exit", KOV_MODULE_PLUGIN}, {"spilled"});
 }
 
 TEST(ModuleExit, ProcessKilledInTheMiddleOfALoadLeavesItsTemporaryDirectoryEmpty) {
@@ -376,12 +352,12 @@ TEST(ModuleExit, ProcessKilledInTheMiddleOfALoadLeavesItsTemporaryDirectoryEmpty
     close(child.out);
 
     EXPECT_NE(out.find("spilled"), std::string::npos) << out;
-    ASSERT_EQ(open.size(), 1u) << join(open);
+    ASSERT_EQ(open.size(), 1u) << joined(open);
     EXPECT_NE(open[0].find(" (deleted)"), std::string::npos) << open[0];
-    EXPECT_TRUE(listed.empty()) << join(listed);
+    EXPECT_TRUE(listed.empty()) << joined(listed);
     ASSERT_TRUE(WIFSIGNALED(status)) << status;
     EXPECT_EQ(WTERMSIG(status), SIGKILL);
-    EXPECT_TRUE(entriesOf(scratch.path()).empty()) << join(entriesOf(scratch.path()));
+    EXPECT_TRUE(entriesOf(scratch.path()).empty()) << joined(entriesOf(scratch.path()));
 }
 
 TEST(ModuleExit, ExitHookLeavesAClosedEmptyPagerThatLaterHostObjectsCanUse) {
@@ -404,7 +380,7 @@ TEST(ModuleExit, ExitHookLeavesAClosedEmptyPagerThatLaterHostObjectsCanUse) {
     EXPECT_EQ(reported, "done\n");
     ASSERT_TRUE(WIFEXITED(status)) << status;
     EXPECT_EQ(WEXITSTATUS(status), 0);
-    EXPECT_TRUE(entriesOf(scratch.path()).empty()) << join(entriesOf(scratch.path()));
+    EXPECT_TRUE(entriesOf(scratch.path()).empty()) << joined(entriesOf(scratch.path()));
 }
 
 TEST(ModuleStartup, FailedFirstConstructionRegistersNothingAndTheNextCallConstructs) {

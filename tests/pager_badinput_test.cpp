@@ -290,12 +290,7 @@ TEST_F(StoreTest, RefusedWritingCursorDoesNothing) {
     }
     KovBtreeCursor reader(t, false);
     KovBtreeCursor refused(t, true);
-    EXPECT_EQ(slotOf(refused).cursor, nullptr);
-    EXPECT_FALSE(refused.first());
-    EXPECT_FALSE(refused.last());
-    EXPECT_FALSE(refused.next());
-    EXPECT_FALSE(refused.previous());
-    EXPECT_FALSE(refused.good());
+    expectRefusedWriter(refused);
     EXPECT_LT(seekBytes(refused, "ab"), 0);
     EXPECT_LT(refused.seek(std::int64_t{1}), 0);
     insertBytes(refused, "zz", "refused");

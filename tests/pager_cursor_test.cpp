@@ -200,12 +200,7 @@ TYPED_TEST(CursorSuite, ReaderLocksWritersOutAndRefusedWriterIsHarmless) {
     {
         KovBtreeCursor reader(*this->table, false);
         KovBtreeCursor refused(*this->table, true);
-        EXPECT_EQ(slotOf(refused).cursor, nullptr);
-        EXPECT_FALSE(refused.first());
-        EXPECT_FALSE(refused.last());
-        EXPECT_FALSE(refused.next());
-        EXPECT_FALSE(refused.previous());
-        EXPECT_FALSE(refused.good());
+        expectRefusedWriter(refused);
         EXPECT_LT(TypeParam::seek(refused, 0), 0);
         EXPECT_EQ(intKey(refused), 0);
         EXPECT_EQ(refused.dataSize(), 0);

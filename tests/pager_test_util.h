@@ -83,6 +83,17 @@ inline const CursorSlot& slotOf(const KovBtreeCursor& c) {
     return KovTestAccess::slots().at(static_cast<std::size_t>(KovTestAccess::slotIndex(c)));
 }
 
+// A writer refused because a reader is open on its table: it has no engine cursor and every
+// move answers false, as on no entry.
+inline void expectRefusedWriter(KovBtreeCursor& refused) {
+    EXPECT_EQ(slotOf(refused).cursor, nullptr);
+    EXPECT_FALSE(refused.first());
+    EXPECT_FALSE(refused.last());
+    EXPECT_FALSE(refused.next());
+    EXPECT_FALSE(refused.previous());
+    EXPECT_FALSE(refused.good());
+}
+
 // Every test starts on an open engine with no registered cursor. A test that leaves slots behind
 // on purpose (after reset) ends with KovTestAccess::teardown().
 class StoreTest : public ::testing::Test {

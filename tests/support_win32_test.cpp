@@ -1,13 +1,7 @@
 // File and directory objects on Windows itself: drives, network shares seen
 // through their attributes, and moves between drives. Everything else is
 // checked on every platform by the other support tests.
-#ifndef WIN32_LEAN_AND_MEAN
-#define WIN32_LEAN_AND_MEAN
-#endif
-#ifndef NOMINMAX
-#define NOMINMAX
-#endif
-#include <windows.h>
+#include "support/Win32Api.h"
 
 #include <gtest/gtest.h>
 

@@ -22,22 +22,14 @@
 #include "tempdir/TempDirectory.h"
 #include "tempdir/TempDirectoryCache.h"
 #include "tempdir/TempDirectorySearch.h"
+#include "tempdir_test_util.h"
 
 namespace {
 
 using kov::TempDirectoryCandidate;
 
-const char* const kVariables[] = {"KOV_TEMP", "TEMP", "TMP", "TMPDIR"};
-
-void setVariable(const std::string& name, const std::string& value) {
-    std::unique_lock<std::shared_mutex> lock(kov::environmentMutex());
-    ASSERT_EQ(::setenv(name.c_str(), value.c_str(), 1), 0);
-}
-
-void unsetVariable(const std::string& name) {
-    std::unique_lock<std::shared_mutex> lock(kov::environmentMutex());
-    ASSERT_EQ(::unsetenv(name.c_str()), 0);
-}
+using kov::test::setVariable;
+using kov::test::unsetVariable;
 
 bool isDirectory(const std::string& path) {
     struct stat status;
@@ -49,69 +41,7 @@ bool existsAtAll(const std::string& path) {
     return ::lstat(path.c_str(), &status) == 0;
 }
 
-class TempDirPosixTest : public ::testing::Test {
-  protected:
-    void SetUp() override {
-        for (const char* name : kVariables) {
-            if (const char* value = std::getenv(name)) {
-                saved_[name] = value;
-            }
-        }
-        const char* tmp = std::getenv("TMPDIR");
-        std::string pattern = std::string(tmp != nullptr && *tmp != '\0' ? tmp : "/tmp") +
-                              "/kov_tempdir_posix_test_XXXXXX";
-        std::vector<char> buffer(pattern.begin(), pattern.end());
-        buffer.push_back('\0');
-        ASSERT_NE(::mkdtemp(buffer.data()), nullptr);
-        // Lexically normal, so that the native form of a path under it is the path itself.
-        base_ = std::filesystem::path(buffer.data()).lexically_normal().string();
-        for (const char* name : kVariables) {
-            unsetVariable(name);
-        }
-        kov::tempDirectoryCache().TEST_reset();
-    }
-
-    void TearDown() override {
-        for (const char* name : kVariables) {
-            auto found = saved_.find(name);
-            if (found != saved_.end()) {
-                setVariable(name, found->second);
-            } else {
-                unsetVariable(name);
-            }
-        }
-        kov::tempDirectoryCache().TEST_reset();
-        removeTree(base_);
-    }
-
-    static void removeTree(const std::string& path) {
-        std::error_code ignored;
-        std::filesystem::remove_all(path, ignored);
-    }
-
-    // A path under the scratch directory.
-    std::string at(const std::string& relative) const { return base_ + "/" + relative; }
-
-    std::string makeDirectory(const std::string& relative) const {
-        const std::string path = at(relative);
-        std::filesystem::create_directories(path);
-        EXPECT_TRUE(isDirectory(path)) << path;
-        return path;
-    }
-
-    std::string makeFile(const std::string& relative) const {
-        const std::string path = at(relative);
-        std::ofstream out(path);
-        out << "not a directory";
-        EXPECT_TRUE(out.good()) << path;
-        return path;
-    }
-
-    static std::string source() { return kov::tempDirectoryCache().source(); }
-
-    std::string base_;
-    std::map<std::string, std::string> saved_;
-};
+using TempDirPosixTest = kov::test::TempDirEnvironmentTest;
 
 // ---- the fixed list ----
 

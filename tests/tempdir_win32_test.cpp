@@ -5,8 +5,8 @@
 // afterwards. The environment is changed under the module's environment lock held exclusively.
 #include <gtest/gtest.h>
 
-// windows.h first: shlobj.h needs its types.
-#include <windows.h>
+// Win32Api.h first: shlobj.h needs the types of windows.h.
+#include "support/Win32Api.h"
 
 #include <shlobj.h>
 #include <stdlib.h>
@@ -25,6 +25,7 @@
 #include "tempdir/TempDirectory.h"
 #include "tempdir/TempDirectoryCache.h"
 #include "tempdir/TempDirectorySearch.h"
+#include "tempdir_test_util.h"
 
 namespace fs = std::filesystem;
 
@@ -32,17 +33,8 @@ namespace {
 
 using kov::TempDirectoryCandidate;
 
-const char* const kVariables[] = {"KOV_TEMP", "TEMP", "TMP"};
-
-void setVariable(const std::string& name, const std::string& value) {
-    std::unique_lock<std::shared_mutex> lock(kov::environmentMutex());
-    ASSERT_EQ(::_putenv_s(name.c_str(), value.c_str()), 0);
-}
-
-// An empty value removes the variable.
-void unsetVariable(const std::string& name) {
-    setVariable(name, "");
-}
+using kov::test::setVariable;
+using kov::test::unsetVariable;
 
 bool isDirectory(const std::string& path) {
     const DWORD attributes = ::GetFileAttributesA(path.c_str());
@@ -73,64 +65,7 @@ char absentDrive() {
     return 'Q';
 }
 
-class TempDirWin32Test : public ::testing::Test {
-  protected:
-    void SetUp() override {
-        for (const char* name : kVariables) {
-            if (const char* value = std::getenv(name)) {
-                saved_[name] = value;
-            }
-        }
-        char folder[MAX_PATH + 1] = {};
-        const DWORD length = ::GetTempPathA(sizeof folder, folder);
-        ASSERT_GT(length, 0u);
-        std::random_device random;
-        base_ = std::string(folder, length);
-        while (!base_.empty() && (base_.back() == '\\' || base_.back() == '/')) {
-            base_.pop_back();
-        }
-        base_ += "\\kov_tempdir_win32_test_" + std::to_string(random());
-        ASSERT_TRUE(::CreateDirectoryA(base_.c_str(), nullptr) != 0) << base_;
-        for (const char* name : kVariables) {
-            unsetVariable(name);
-        }
-        kov::tempDirectoryCache().TEST_reset();
-    }
-
-    void TearDown() override {
-        for (const char* name : kVariables) {
-            auto found = saved_.find(name);
-            setVariable(name, found != saved_.end() ? found->second : std::string());
-        }
-        kov::tempDirectoryCache().TEST_reset();
-        std::error_code ignored;
-        fs::remove_all(base_, ignored);
-    }
-
-    // A path under the scratch directory in native form (backslashes).
-    std::string at(const std::string& relative) const { return base_ + "\\" + relative; }
-
-    std::string makeDirectory(const std::string& relative) const {
-        const std::string path = at(relative);
-        std::error_code ignored;
-        fs::create_directories(path, ignored);
-        EXPECT_TRUE(isDirectory(path)) << path;
-        return path;
-    }
-
-    std::string makeFile(const std::string& relative) const {
-        const std::string path = at(relative);
-        std::ofstream out(path);
-        out << "not a directory";
-        EXPECT_TRUE(out.good()) << path;
-        return path;
-    }
-
-    static std::string source() { return kov::tempDirectoryCache().source(); }
-
-    std::string base_;
-    std::map<std::string, std::string> saved_;
-};
+using TempDirWin32Test = kov::test::TempDirEnvironmentTest;
 
 // ---- the fixed list ----
 

@@ -2,13 +2,7 @@
 // lossy, and the narrow path form of the file objects, which takes the lossy way. The byte
 // values are those of code page 1252 (Western European, Wine's choice for an English or C
 // locale); under another ANSI code page only the tests that hold for every code page run.
-#ifndef WIN32_LEAN_AND_MEAN
-#define WIN32_LEAN_AND_MEAN
-#endif
-#ifndef NOMINMAX
-#define NOMINMAX
-#endif
-#include <windows.h>
+#include "support/Win32Api.h"
 
 #include <gtest/gtest.h>
 
