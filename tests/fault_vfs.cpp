@@ -41,6 +41,19 @@ bool isTemporaryOpen(const char* name, int flags) {
 struct FaultVfs::Hooks {
     static FaultVfs* of(sqlite3_vfs* v) { return static_cast<FaultVfs*>(v->pAppData); }
 
+    // A method that only passes the call on to the wrapped file (Method: the member of
+    // sqlite3_io_methods) or to the wrapped VFS (a member of sqlite3_vfs), unchanged.
+    template <auto Method, typename... Args>
+    static auto passToFile(sqlite3_file* f, Args... args) {
+        sqlite3_file* real = realFile(f);
+        return (real->pMethods->*Method)(real, args...);
+    }
+    template <auto Method, typename... Args>
+    static auto passToVfs(sqlite3_vfs* v, Args... args) {
+        sqlite3_vfs* real = of(v)->real_;
+        return (real->*Method)(real, args...);
+    }
+
     // File methods.
     static int close(sqlite3_file* f) {
         FaultFile* ff = faultFile(f);
@@ -98,34 +111,6 @@ struct FaultVfs::Hooks {
         sqlite3_file* real = realFile(f);
         return real->pMethods->xSync(real, flags);
     }
-    static int fileSize(sqlite3_file* f, sqlite3_int64* pSize) {
-        sqlite3_file* real = realFile(f);
-        return real->pMethods->xFileSize(real, pSize);
-    }
-    static int lock(sqlite3_file* f, int level) {
-        sqlite3_file* real = realFile(f);
-        return real->pMethods->xLock(real, level);
-    }
-    static int unlock(sqlite3_file* f, int level) {
-        sqlite3_file* real = realFile(f);
-        return real->pMethods->xUnlock(real, level);
-    }
-    static int checkReservedLock(sqlite3_file* f, int* pResOut) {
-        sqlite3_file* real = realFile(f);
-        return real->pMethods->xCheckReservedLock(real, pResOut);
-    }
-    static int fileControl(sqlite3_file* f, int op, void* pArg) {
-        sqlite3_file* real = realFile(f);
-        return real->pMethods->xFileControl(real, op, pArg);
-    }
-    static int sectorSize(sqlite3_file* f) {
-        sqlite3_file* real = realFile(f);
-        return real->pMethods->xSectorSize(real);
-    }
-    static int deviceCharacteristics(sqlite3_file* f) {
-        sqlite3_file* real = realFile(f);
-        return real->pMethods->xDeviceCharacteristics(real);
-    }
 
     static const sqlite3_io_methods methods;
 
@@ -163,46 +148,6 @@ struct FaultVfs::Hooks {
         }
         return rc;
     }
-    static int remove(sqlite3_vfs* v, const char* name, int syncDir) {
-        sqlite3_vfs* real = of(v)->real_;
-        return real->xDelete(real, name, syncDir);
-    }
-    static int access(sqlite3_vfs* v, const char* name, int flags, int* pResOut) {
-        sqlite3_vfs* real = of(v)->real_;
-        return real->xAccess(real, name, flags, pResOut);
-    }
-    static int fullPathname(sqlite3_vfs* v, const char* name, int nOut, char* zOut) {
-        sqlite3_vfs* real = of(v)->real_;
-        return real->xFullPathname(real, name, nOut, zOut);
-    }
-    static void* dlOpen(sqlite3_vfs* v, const char* name) {
-        sqlite3_vfs* real = of(v)->real_;
-        return real->xDlOpen(real, name);
-    }
-    static void dlError(sqlite3_vfs* v, int nByte, char* zErrMsg) {
-        sqlite3_vfs* real = of(v)->real_;
-        real->xDlError(real, nByte, zErrMsg);
-    }
-    static void (*dlSym(sqlite3_vfs* v, void* handle, const char* symbol))(void) {
-        sqlite3_vfs* real = of(v)->real_;
-        return real->xDlSym(real, handle, symbol);
-    }
-    static void dlClose(sqlite3_vfs* v, void* handle) {
-        sqlite3_vfs* real = of(v)->real_;
-        real->xDlClose(real, handle);
-    }
-    static int randomness(sqlite3_vfs* v, int nByte, char* zOut) {
-        sqlite3_vfs* real = of(v)->real_;
-        return real->xRandomness(real, nByte, zOut);
-    }
-    static int sleep(sqlite3_vfs* v, int microseconds) {
-        sqlite3_vfs* real = of(v)->real_;
-        return real->xSleep(real, microseconds);
-    }
-    static int currentTime(sqlite3_vfs* v, double* pOut) {
-        sqlite3_vfs* real = of(v)->real_;
-        return real->xCurrentTime(real, pOut);
-    }
     static int getLastError(sqlite3_vfs* v, int n, char* zOut) {
         sqlite3_vfs* real = of(v)->real_;
         return real->xGetLastError != nullptr ? real->xGetLastError(real, n, zOut) : 0;
@@ -225,13 +170,13 @@ const sqlite3_io_methods FaultVfs::Hooks::methods = {
     &FaultVfs::Hooks::write,
     &FaultVfs::Hooks::truncate,
     &FaultVfs::Hooks::sync,
-    &FaultVfs::Hooks::fileSize,
-    &FaultVfs::Hooks::lock,
-    &FaultVfs::Hooks::unlock,
-    &FaultVfs::Hooks::checkReservedLock,
-    &FaultVfs::Hooks::fileControl,
-    &FaultVfs::Hooks::sectorSize,
-    &FaultVfs::Hooks::deviceCharacteristics,
+    &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xFileSize, sqlite3_int64*>,
+    &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xLock, int>,
+    &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xUnlock, int>,
+    &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xCheckReservedLock, int*>,
+    &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xFileControl, int, void*>,
+    &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xSectorSize>,
+    &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xDeviceCharacteristics>,
     nullptr,
     nullptr,
     nullptr,
@@ -247,16 +192,17 @@ FaultVfs::FaultVfs() : real_(sqlite3_vfs_find(nullptr)) {
     vfs_.zName = "kov-fault";
     vfs_.pAppData = this;
     vfs_.xOpen = &Hooks::open;
-    vfs_.xDelete = &Hooks::remove;
-    vfs_.xAccess = &Hooks::access;
-    vfs_.xFullPathname = &Hooks::fullPathname;
-    vfs_.xDlOpen = &Hooks::dlOpen;
-    vfs_.xDlError = &Hooks::dlError;
-    vfs_.xDlSym = &Hooks::dlSym;
-    vfs_.xDlClose = &Hooks::dlClose;
-    vfs_.xRandomness = &Hooks::randomness;
-    vfs_.xSleep = &Hooks::sleep;
-    vfs_.xCurrentTime = &Hooks::currentTime;
+    vfs_.xDelete = &Hooks::passToVfs<&sqlite3_vfs::xDelete, const char*, int>;
+    vfs_.xAccess = &Hooks::passToVfs<&sqlite3_vfs::xAccess, const char*, int, int*>;
+    vfs_.xFullPathname =
+        &Hooks::passToVfs<&sqlite3_vfs::xFullPathname, const char*, int, char*>;
+    vfs_.xDlOpen = &Hooks::passToVfs<&sqlite3_vfs::xDlOpen, const char*>;
+    vfs_.xDlError = &Hooks::passToVfs<&sqlite3_vfs::xDlError, int, char*>;
+    vfs_.xDlSym = &Hooks::passToVfs<&sqlite3_vfs::xDlSym, void*, const char*>;
+    vfs_.xDlClose = &Hooks::passToVfs<&sqlite3_vfs::xDlClose, void*>;
+    vfs_.xRandomness = &Hooks::passToVfs<&sqlite3_vfs::xRandomness, int, char*>;
+    vfs_.xSleep = &Hooks::passToVfs<&sqlite3_vfs::xSleep, int>;
+    vfs_.xCurrentTime = &Hooks::passToVfs<&sqlite3_vfs::xCurrentTime, double*>;
     vfs_.xGetLastError = &Hooks::getLastError;
     vfs_.xCurrentTimeInt64 = &Hooks::currentTimeInt64;
 }
