@@ -14,12 +14,12 @@
 
 #include <atomic>
 #include <cstddef>
-#include <random>
 #include <string>
 #include <thread>
 #include <vector>
 
 #include "host_util.h"
+#include "scratch_directory.h"
 
 namespace {
 
@@ -167,38 +167,6 @@ TEST(DllModuleWin32, LoadingTwiceCountsReferences) {
 
 // ---- the host program, one process per case ----
 
-// A fresh, empty directory under %TEMP%; removed with what is in it on destruction.
-class ScratchDirectory {
-  public:
-    ScratchDirectory() {
-        char base[MAX_PATH + 1] = {};
-        const DWORD n = GetTempPathA(sizeof base, base);
-        std::random_device random;
-        for (int attempt = 0; attempt < 100 && path_.empty(); ++attempt) {
-            const std::string candidate =
-                std::string(base, n) + "kov-dll-host-" + std::to_string(random());
-            if (CreateDirectoryA(candidate.c_str(), nullptr) != 0)
-                path_ = candidate;
-        }
-    }
-    ~ScratchDirectory() {
-        if (path_.empty())
-            return;
-        for (const std::string& name : entries())
-            DeleteFileA((path_ + "\\" + name).c_str());
-        RemoveDirectoryA(path_.c_str());
-    }
-    ScratchDirectory(const ScratchDirectory&) = delete;
-    ScratchDirectory& operator=(const ScratchDirectory&) = delete;
-
-    const std::string& path() const { return path_; }
-
-    std::vector<std::string> entries() const { return kov::test::entriesOf(path_); }
-
-  private:
-    std::string path_;
-};
-
 std::string quoted(const std::string& argument) {
     return "\"" + argument + "\"";
 }
@@ -234,28 +202,28 @@ int runHost(const std::vector<std::string>& arguments, const std::string& kovTem
 }
 
 TEST(DllHostWin32, LoadWithoutUsingTheStoreCreatesNothing) {
-    ScratchDirectory scratch;
+    const kov::test::ScratchDirectory scratch("kov-dll-host-");
     ASSERT_FALSE(scratch.path().empty());
     EXPECT_EQ(runHost({"load-only", libraryPath()}, scratch.path()), 0);
-    EXPECT_TRUE(scratch.entries().empty());
+    EXPECT_TRUE(kov::test::entriesOf(scratch.path()).empty());
 }
 
 TEST(DllHostWin32, PagerByItsMangledNameThenUnloadLeavesNothing) {
-    ScratchDirectory scratch;
+    const kov::test::ScratchDirectory scratch("kov-dll-host-");
     ASSERT_FALSE(scratch.path().empty());
     EXPECT_EQ(runHost({"instance-by-name", libraryPath()}, scratch.path()), 0);
-    EXPECT_TRUE(scratch.entries().empty());
+    EXPECT_TRUE(kov::test::entriesOf(scratch.path()).empty());
 }
 
 TEST(DllHostWin32, StorePastItsCacheThenUnloadLeavesNothing) {
-    ScratchDirectory scratch;
+    const kov::test::ScratchDirectory scratch("kov-dll-host-");
     ASSERT_FALSE(scratch.path().empty());
     const std::string library = libraryPath();
     EXPECT_EQ(runHost({"use-and-unload", besideThisProgram(KOV_DLL_PLUGIN), directoryOf(library),
                        baseName(library)},
                       scratch.path()),
               0);
-    EXPECT_TRUE(scratch.entries().empty());
+    EXPECT_TRUE(kov::test::entriesOf(scratch.path()).empty());
 }
 
 }  // namespace

@@ -17,6 +17,8 @@
 
 #include "engine/btree.h"
 #include "engine_test_util.h"
+#include "host_util.h"
+#include "scratch_directory.h"
 
 namespace {
 
@@ -41,44 +43,6 @@ void fillValue(std::int64_t key, int generation, std::string& out) {
         std::memcpy(out.data() + i, &x, 8);
     }
 }
-
-// A fresh, empty directory under the system's temporary path; removed with
-// its content on destruction.
-class ScratchDir {
-  public:
-    ScratchDir() {
-        std::random_device rd;
-        for (int attempt = 0; attempt < 100 && path_.empty(); ++attempt) {
-            fs::path candidate =
-                fs::temp_directory_path() /
-                ("kovpager-engine-large-" + std::to_string(rd()) + "-" + std::to_string(rd()));
-            std::error_code ec;
-            if (fs::create_directory(candidate, ec) && !ec)
-                path_ = fs::canonical(candidate, ec);
-        }
-    }
-    ~ScratchDir() {
-        std::error_code ec;
-        if (!path_.empty())
-            fs::remove_all(path_, ec);
-    }
-    ScratchDir(const ScratchDir&) = delete;
-    ScratchDir& operator=(const ScratchDir&) = delete;
-
-    const fs::path& path() const { return path_; }
-
-    // The names of the entries in the directory.
-    std::vector<std::string> entries() const {
-        std::vector<std::string> names;
-        std::error_code ec;
-        for (fs::directory_iterator it(path_, ec), end; !ec && it != end; it.increment(ec))
-            names.push_back(it->path().filename().string());
-        return names;
-    }
-
-  private:
-    fs::path path_;
-};
 
 // The targets of this process's open file descriptors that lie in `dir`,
 // as the kernel shows them (a deleted file's target ends in " (deleted)").
@@ -134,15 +98,18 @@ class TempDirSetting {
 };
 
 TEST(EngineLarge, RunPastTheCacheSpillsIntoTheTemporaryDirectoryAndReadsBack) {
-    ScratchDir scratch;
+    const kov::test::ScratchDirectory scratch("kovpager-engine-large-");
     ASSERT_FALSE(scratch.path().empty()) << "could not make a scratch directory";
+    // Resolved, as the targets of /proc/self/fd are.
+    const fs::path dir = fs::canonical(scratch.path());
+    const auto entries = [&dir] { return kov::test::entriesOf(dir.string()); };
     const bool procFd = haveProcFd();
     if (procFd) {
-        ASSERT_TRUE(openFilesIn(scratch.path()).empty());
+        ASSERT_TRUE(openFilesIn(dir).empty());
     }
 
     {
-        TempDirSetting setting(scratch.path().string());
+        TempDirSetting setting(dir.string());
         TestEngine engine;  // the store's settings, BeginTrans(2)
         ASSERT_EQ(engine.openRc, SQLITE_OK);
         ASSERT_NE(engine.get(), nullptr);
@@ -170,16 +137,16 @@ TEST(EngineLarge, RunPastTheCacheSpillsIntoTheTemporaryDirectoryAndReadsBack) {
         // The data is far larger than the cache, so the temporary file exists
         // by now: open in the scratch directory and already unlinked from it.
         if (procFd) {
-            std::vector<std::string> open = openFilesIn(scratch.path());
-            ASSERT_FALSE(open.empty()) << "no temporary file open in " << scratch.path();
+            std::vector<std::string> open = openFilesIn(dir);
+            ASSERT_FALSE(open.empty()) << "no temporary file open in " << dir;
             for (const auto& target : open)
                 EXPECT_TRUE(endsWith(target, " (deleted)")) << target;
-            EXPECT_TRUE(scratch.entries().empty())
-                << "the temporary file is still linked: " << scratch.entries().front();
+            EXPECT_TRUE(entries().empty())
+                << "the temporary file is still linked: " << entries().front();
         } else if (KOV_TEST_PROC_FD == 0) {
             // Windows: the file is opened to be deleted when closed, and its
             // name stays in the directory until then.
-            EXPECT_FALSE(scratch.entries().empty()) << "no temporary file in " << scratch.path();
+            EXPECT_FALSE(entries().empty()) << "no temporary file in " << dir;
         }
 
         // Every record, in key order.
@@ -226,10 +193,10 @@ TEST(EngineLarge, RunPastTheCacheSpillsIntoTheTemporaryDirectoryAndReadsBack) {
 
     // Nothing open there and nothing left behind.
     if (procFd) {
-        std::vector<std::string> open = openFilesIn(scratch.path());
+        std::vector<std::string> open = openFilesIn(dir);
         EXPECT_TRUE(open.empty()) << "still open after Close: " << open.front();
     }
-    std::vector<std::string> left = scratch.entries();
+    std::vector<std::string> left = entries();
     EXPECT_TRUE(left.empty()) << "left in the temporary directory: " << left.front();
 }
 

@@ -6,7 +6,6 @@
 
 #include <dlfcn.h>
 #include <sqlite3.h>
-#include <unistd.h>
 
 #include <kovpager/KovBtree.h>
 #include <kovpager/KovBtreeCursor.h>
@@ -18,6 +17,8 @@
 #include <memory>
 #include <string>
 #include <vector>
+
+#include "scratch_directory.h"
 
 namespace fs = std::filesystem;
 
@@ -35,14 +36,6 @@ std::vector<std::string> openFilesIn(const std::string& dir) {
             found.push_back(target);
     }
     return found;
-}
-
-std::string makeDirectory(const std::string& name) {
-    const fs::path dir = fs::temp_directory_path() /
-                         ("kov-host-" + name + "-" + std::to_string(::getpid()));
-    fs::remove_all(dir);
-    fs::create_directories(dir);
-    return dir.string();
 }
 
 void exec(sqlite3* db, const char* sql) {
@@ -74,8 +67,11 @@ std::int64_t hostRows(sqlite3* db) {
 }  // namespace
 
 TEST(SqliteHost, HostSqliteKeepsItsTemporaryDirectoryAndFilesWhileTheStoreSpills) {
-    const std::string hostDir = makeDirectory("sqlite");
-    const std::string storeDir = makeDirectory("store");
+    const kov::test::ScratchDirectory hostScratch("kov-host-sqlite-");
+    const kov::test::ScratchDirectory storeScratch("kov-host-store-");
+    const std::string& hostDir = hostScratch.path();
+    const std::string& storeDir = storeScratch.path();
+    ASSERT_FALSE(hostDir.empty() || storeDir.empty()) << "no scratch directories";
     ASSERT_EQ(::setenv("KOV_TEMP", storeDir.c_str(), 1), 0);
 
     // The host sets its SQLite's temporary directory before anything else and opens a temporary
@@ -135,8 +131,6 @@ TEST(SqliteHost, HostSqliteKeepsItsTemporaryDirectoryAndFilesWhileTheStoreSpills
     EXPECT_TRUE(openFilesIn(hostDir).empty());
     sqlite3_temp_directory = nullptr;
     sqlite3_free(hostSetting);
-    fs::remove_all(hostDir);
-    fs::remove_all(storeDir);
 }
 
 // The library brings none of SQLite's names into the host: the host's calls reach the system's

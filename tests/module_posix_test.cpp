@@ -30,6 +30,7 @@
 #include "host_util.h"
 #include "kov_test_access.h"
 #include "pager_test_util.h"
+#include "scratch_directory.h"
 #include "support/FileSystem.h"
 
 extern "C" char** environ;
@@ -50,33 +51,9 @@ namespace {
 using namespace kovtest;
 using kov::test::entriesOf;
 using kov::test::joined;
+using kov::test::ScratchDirectory;
 
 // --- scratch directories and processes ---
-
-// A fresh, empty directory for one test's KOV_TEMP; removed (with whatever a failing test left in
-// it) at the end of the test.
-class Scratch {
-  public:
-    Scratch() {
-        const char* base = std::getenv("TMPDIR");
-        std::string pattern =
-            std::string(base != nullptr && *base != '\0' ? base : "/tmp") + "/kov_module_XXXXXX";
-        if (mkdtemp(pattern.data()) != nullptr)
-            path_ = pattern;
-    }
-    ~Scratch() {
-        for (const std::string& name : entriesOf(path_))
-            std::remove((path_ + "/" + name).c_str());
-        rmdir(path_.c_str());
-    }
-    Scratch(const Scratch&) = delete;
-    Scratch& operator=(const Scratch&) = delete;
-
-    const std::string& path() const { return path_; }
-
-  private:
-    std::string path_;
-};
 
 // A child process with its standard output on a pipe.
 struct Child {
@@ -314,7 +291,7 @@ TEST(ModuleLibrary, IsNeitherNodeleteNorPinnedByUniqueSymbols) {
 // with 0 after printing each of `printed`, and leave the directory empty.
 static void expectHostLeavesNothing(const std::vector<std::string>& arguments,
                              const std::vector<std::string>& printed) {
-    Scratch scratch;
+    const ScratchDirectory scratch("kov_module_");  // the test's KOV_TEMP
     ASSERT_FALSE(scratch.path().empty());
     int status = 0;
     const std::string out = runHost(arguments, scratch.path(), status);
@@ -339,7 +316,7 @@ TEST(ModuleExit, ProcessThatExitsAfterUseLeavesItsTemporaryDirectoryEmpty) {
 }
 
 TEST(ModuleExit, ProcessKilledInTheMiddleOfALoadLeavesItsTemporaryDirectoryEmpty) {
-    Scratch scratch;
+    const ScratchDirectory scratch("kov_module_");  // the test's KOV_TEMP
     ASSERT_FALSE(scratch.path().empty());
     Child child = startHost({"load-forever", KOV_MODULE_PLUGIN}, scratch.path());
     ASSERT_GT(child.pid, 0);
@@ -361,7 +338,7 @@ TEST(ModuleExit, ProcessKilledInTheMiddleOfALoadLeavesItsTemporaryDirectoryEmpty
 }
 
 TEST(ModuleExit, ExitHookLeavesAClosedEmptyPagerThatLaterHostObjectsCanUse) {
-    Scratch scratch;
+    const ScratchDirectory scratch("kov_module_");  // the test's KOV_TEMP
     ASSERT_FALSE(scratch.path().empty());
     int status = 0;
     const std::string reported = runInChild(
@@ -384,7 +361,7 @@ TEST(ModuleExit, ExitHookLeavesAClosedEmptyPagerThatLaterHostObjectsCanUse) {
 }
 
 TEST(ModuleStartup, FailedFirstConstructionRegistersNothingAndTheNextCallConstructs) {
-    Scratch scratch;
+    const ScratchDirectory scratch("kov_module_");  // the test's KOV_TEMP
     ASSERT_FALSE(scratch.path().empty());
     int status = 0;
     const std::string reported = runInChild(

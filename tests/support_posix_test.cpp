@@ -18,6 +18,7 @@
 #include <string>
 #include <vector>
 
+#include "scratch_directory.h"
 #include "support/FileSystem.h"
 #include "support/KovDirectory.h"
 #include "support/KovFile.h"
@@ -130,22 +131,20 @@ class WorkingDirectory {
 class Support : public ::testing::Test {
   protected:
     void SetUp() override {
-        const char* base = std::getenv("TMPDIR");
-        std::string pattern =
-            std::string(base != nullptr && *base != '\0' ? base : "/tmp") + "/kov-support-XXXXXX";
-        ASSERT_NE(::mkdtemp(&pattern[0]), nullptr);
-        root_ = pattern;
+        root_ = scratch_.path();
+        ASSERT_FALSE(root_.empty()) << "no scratch directory";
         previous_ = kov::fs::TEST_setFileSystem(&fs_);
     }
     void TearDown() override {
         kov::fs::TEST_setFileSystem(previous_);
+        // Directories a test made unreadable are opened up again, so that the scratch directory
+        // can be removed with everything in it.
         std::error_code ec;
         for (auto& p : std::filesystem::recursive_directory_iterator(
                  root_, std::filesystem::directory_options::skip_permission_denied, ec)) {
             if (p.is_directory(ec) && !p.is_symlink(ec))
                 ::chmod(p.path().c_str(), 0700);
         }
-        std::filesystem::remove_all(root_, ec);
     }
 
     std::string at(const std::string& relative) const { return root_ + "/" + relative; }
@@ -180,6 +179,7 @@ class Support : public ::testing::Test {
         return out;
     }
 
+    kov::test::ScratchDirectory scratch_{"kov-support-"};
     std::string root_;
     SteeredFileSystem fs_;
     kov::fs::FileSystem* previous_ = nullptr;

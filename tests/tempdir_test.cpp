@@ -5,10 +5,10 @@
 #include <filesystem>
 #include <fstream>
 #include <optional>
-#include <random>
 #include <string>
 #include <vector>
 
+#include "scratch_directory.h"
 #include "tempdir/StripCharacters.h"
 #include "tempdir/TempDirectory.h"
 #include "tempdir/TempDirectoryCache.h"
@@ -27,17 +27,10 @@ class TempDirTest : public ::testing::Test {
   protected:
     void SetUp() override {
         kov::tempDirectoryCache().TEST_reset();
-        std::random_device random;
-        base_ = (fs::temp_directory_path() /
-                 ("kov_tempdir_test_" + std::to_string(random()) + std::to_string(random())))
-                    .lexically_normal();
-        ASSERT_TRUE(fs::create_directory(base_));
+        base_ = scratch_.path();
+        ASSERT_FALSE(base_.empty()) << "no scratch directory";
     }
-    void TearDown() override {
-        std::error_code ignored;
-        fs::remove_all(base_, ignored);
-        kov::tempDirectoryCache().TEST_reset();
-    }
+    void TearDown() override { kov::tempDirectoryCache().TEST_reset(); }
 
     // A path under the scratch directory, with forward slashes.
     std::string at(const std::string& relative) const {
@@ -63,6 +56,7 @@ class TempDirTest : public ::testing::Test {
         return fs::exists(base_ / relative, ignored);
     }
 
+    kov::test::ScratchDirectory scratch_{"kov_tempdir_test_"};
     fs::path base_;
 };
 

@@ -14,12 +14,12 @@
 #include <fstream>
 #include <map>
 #include <mutex>
-#include <random>
 #include <shared_mutex>
 #include <string>
 #include <system_error>
 
 #include "tempdir/TempDirectoryCache.h"
+#include "scratch_directory.h"
 #include "tempdir/TempDirectorySearch.h"
 
 namespace kov::test {
@@ -59,15 +59,9 @@ class TempDirEnvironmentTest : public ::testing::Test {
                 saved_[name] = value;
             }
         }
-        // Under the platform's own temporary directory (on POSIX $TMPDIR or /tmp), read before
-        // the variables are unset; lexically normal and native, so that the native form of a
-        // path under it is the path itself.
-        std::random_device random;
-        const std::filesystem::path base =
-            std::filesystem::temp_directory_path() /
-            ("kov_tempdir_env_test_" + std::to_string(random()) + std::to_string(random()));
-        base_ = base.lexically_normal().make_preferred().string();
-        ASSERT_TRUE(std::filesystem::create_directory(base_)) << base_;
+        // The scratch directory was made with the fixture, before the variables are unset.
+        base_ = scratch_.path();
+        ASSERT_FALSE(base_.empty()) << "no scratch directory";
         for (const char* name : kTempVariables) {
             unsetVariable(name);
         }
@@ -84,7 +78,6 @@ class TempDirEnvironmentTest : public ::testing::Test {
             }
         }
         kov::tempDirectoryCache().TEST_reset();
-        removeTree(base_);
     }
 
     static void removeTree(const std::string& path) {
@@ -116,6 +109,9 @@ class TempDirEnvironmentTest : public ::testing::Test {
     // The variable that supplied the published directory, or empty.
     static std::string source() { return kov::tempDirectoryCache().source(); }
 
+    // Under the platform's own temporary directory (on POSIX $TMPDIR or /tmp), lexically normal
+    // and native, so that the native form of a path under it is the path itself.
+    ScratchDirectory scratch_{"kov_tempdir_env_test_"};
     std::string base_;
     std::map<std::string, std::string> saved_;
 };
