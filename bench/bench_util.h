@@ -67,16 +67,22 @@ inline std::int64_t takeWorkloadSize(int* argc, char** argv) {
     return std::max<std::int64_t>(n, 1000);
 }
 
+constexpr std::uint64_t kGolden = 0x9E3779B97F4A7C15ULL;
+
+// The SplitMix64 output for a given state: Random's k-th draw (k from 1) is
+// mix(seed + k * kGolden), so a draw can also be computed without the ones
+// before it.
+inline std::uint64_t mix(std::uint64_t z) {
+    z = (z ^ (z >> 30)) * 0xBF58476D1CE4E5B9ULL;
+    z = (z ^ (z >> 27)) * 0x94D049BB133111EBULL;
+    return z ^ (z >> 31);
+}
+
 // SplitMix64: a small, fast, reproducible generator.
 class Random {
   public:
     explicit Random(std::uint64_t seed) : state_(seed) {}
-    std::uint64_t next() {
-        std::uint64_t z = (state_ += 0x9E3779B97F4A7C15ULL);
-        z = (z ^ (z >> 30)) * 0xBF58476D1CE4E5B9ULL;
-        z = (z ^ (z >> 27)) * 0x94D049BB133111EBULL;
-        return z ^ (z >> 31);
-    }
+    std::uint64_t next() { return mix(state_ += kGolden); }
     std::size_t below(std::size_t bound) { return static_cast<std::size_t>(next() % bound); }
 
   private:
@@ -131,6 +137,41 @@ inline const std::vector<Key16>& workloadKeys(std::size_t n) {
     }
     return keys;
 }
+
+// Composite keys of 16 bytes: an 8-byte group prefix (one of 1 000) followed
+// by an 8-byte random payload, made one at a time in insertion order; and the
+// order in which the groups are walked.
+class CompositeKeys {
+  public:
+    static constexpr std::size_t kGroups = 1000;
+    static constexpr std::size_t kPrefixSize = 8;
+
+    CompositeKeys()
+        : prefixes_(randomKeys(kGroups, kGroupPrefixSeed)), random_(kPayloadSeed) {
+        walk_.resize(kGroups);
+        for (std::size_t i = 0; i < kGroups; ++i) {
+            walk_[i] = i;
+        }
+        Random order(0x77616c6b);
+        for (std::size_t i = kGroups - 1; i > 0; --i) {
+            std::swap(walk_[i], walk_[order.below(i + 1)]);
+        }
+    }
+    // The next key of the insertion sequence.
+    Key16 next() {
+        Key16 k;
+        std::memcpy(k.data(), prefixes_[random_.below(kGroups)].data(), kPrefixSize);
+        putBigEndian(k.data() + kPrefixSize, random_.next());
+        return k;
+    }
+    // The prefix of the g-th group in walk order (its first kPrefixSize bytes).
+    const unsigned char* walkPrefix(std::size_t g) const { return prefixes_[walk_[g]].data(); }
+
+  private:
+    std::vector<Key16> prefixes_;
+    std::vector<std::size_t> walk_;
+    Random random_;
+};
 
 // The 100-byte data of entry i: its index in the first 8 bytes, then a
 // fixed pattern.

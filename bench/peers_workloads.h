@@ -5,8 +5,8 @@
 //   RandomKeys keys(n);        // W3..W5: key i is keys.at(i), 16 random bytes,
 //                              // the same bytes bench_util's randomKeys gives
 //   Shuffle order(n);          // W2: order.at(i) is a permutation of [0, n)
-//   CompositeKeys groups;      // W6: 1 000 group prefixes, a walk order and a
-//                              // generator of (random group prefix, random payload)
+//   CompositeKeys groups;      // W6 (bench_util.h): 1 000 group prefixes, a walk
+//                              // order and a generator of (group prefix, payload)
 //
 // Every backend sees the same keys in the same order, so the tallies of the
 // read workloads agree across backends (the driver prints them).
@@ -22,19 +22,12 @@
 
 namespace kov::peers {
 
+using kov::bench::CompositeKeys;  // W6
 using kov::bench::Key16;
+using kov::bench::kGolden;
+using kov::bench::mix;
 using kov::bench::putBigEndian;
 using kov::bench::Random;
-
-constexpr std::uint64_t kGolden = 0x9E3779B97F4A7C15ULL;
-
-// The SplitMix64 output for a given state: Random's k-th draw (k from 1) is
-// mix(seed + k * kGolden).
-inline std::uint64_t mix(std::uint64_t z) {
-    z = (z ^ (z >> 30)) * 0xBF58476D1CE4E5B9ULL;
-    z = (z ^ (z >> 27)) * 0x94D049BB133111EBULL;
-    return z ^ (z >> 31);
-}
 
 // N random 16-byte keys with random access: key i is the generator's draws
 // 2i+1 and 2i+2, big-endian.
@@ -89,41 +82,6 @@ class Shuffle {
     std::uint64_t n_;
     unsigned half_ = 1;
     std::uint64_t mask_ = 1;
-};
-
-// W6: composite keys of 16 bytes, an 8-byte group prefix (one of 1 000)
-// followed by an 8-byte random payload, made in insertion order.
-class CompositeKeys {
-  public:
-    static constexpr std::size_t kGroups = 1000;
-    static constexpr std::size_t kPrefixSize = 8;
-
-    CompositeKeys()
-        : prefixes_(kov::bench::randomKeys(kGroups, kov::bench::kGroupPrefixSeed)),
-          random_(kov::bench::kPayloadSeed) {
-        walk_.resize(kGroups);
-        for (std::size_t i = 0; i < kGroups; ++i) {
-            walk_[i] = i;
-        }
-        Random order(0x77616c6b);
-        for (std::size_t i = kGroups - 1; i > 0; --i) {
-            std::swap(walk_[i], walk_[order.below(i + 1)]);
-        }
-    }
-    // The next key of the insertion sequence.
-    Key16 next() {
-        Key16 k;
-        std::memcpy(k.data(), prefixes_[random_.below(kGroups)].data(), kPrefixSize);
-        putBigEndian(k.data() + kPrefixSize, random_.next());
-        return k;
-    }
-    // The prefix of the g-th group in walk order (its first kPrefixSize bytes).
-    const unsigned char* walkPrefix(std::size_t g) const { return prefixes_[walk_[g]].data(); }
-
-  private:
-    std::vector<Key16> prefixes_;
-    std::vector<std::size_t> walk_;
-    Random random_;
 };
 
 }  // namespace kov::peers

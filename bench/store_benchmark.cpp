@@ -42,6 +42,7 @@
 
 namespace {
 
+using kov::bench::CompositeKeys;
 using kov::bench::kDataSize;
 using kov::bench::Key16;
 using kov::bench::PairedRun;
@@ -52,8 +53,6 @@ using kov::bench::RawIntTable;
 using kov::bench::RawKeyTable;
 using kov::bench::Tally;
 
-constexpr std::size_t kGroups = 1000;
-constexpr std::size_t kPrefixSize = 8;
 constexpr std::size_t kWalkChunk = 8;  // groups
 
 // A raw table and a store table of the same kind, side by side.
@@ -114,31 +113,20 @@ class StoreCursor {
     std::string key_;
 };
 
-// The N composite keys, in insertion order: the prefix of a random group,
-// then a random payload.
-struct CompositeKeys {
-    std::vector<Key16> prefixes;    // kGroups group prefixes (first 8 bytes used)
-    std::vector<Key16> keys;        // N keys
-    std::vector<std::size_t> walk;  // the order in which groups are walked
-    std::size_t distinct = 0;       // distinct keys among `keys`
+// The N composite keys of the workloads in insertion order, with their
+// generator (which also gives the walk order), made on first use and kept.
+struct CompositeSet {
+    CompositeKeys groups;
+    std::vector<Key16> keys;
+    std::size_t distinct = 0;  // distinct keys among `keys`
 };
-const CompositeKeys& compositeKeys(std::size_t n) {
-    static CompositeKeys c;
+const CompositeSet& compositeKeys(std::size_t n) {
+    static CompositeSet c;
     if (c.keys.size() != n) {
-        c.prefixes = kov::bench::randomKeys(kGroups, kov::bench::kGroupPrefixSeed);
-        kov::bench::Random random(kov::bench::kPayloadSeed);
+        c.groups = CompositeKeys();
         c.keys.resize(n);
         for (Key16& k : c.keys) {
-            const Key16& prefix = c.prefixes[random.below(kGroups)];
-            std::memcpy(k.data(), prefix.data(), kPrefixSize);
-            kov::bench::putBigEndian(k.data() + kPrefixSize, random.next());
-        }
-        c.walk.resize(kGroups);
-        for (std::size_t i = 0; i < kGroups; ++i) {
-            c.walk[i] = i;
-        }
-        for (std::size_t i = kGroups - 1; i > 0; --i) {
-            std::swap(c.walk[i], c.walk[random.below(i + 1)]);
+            k = c.groups.next();
         }
         std::vector<Key16> sorted = c.keys;
         std::sort(sorted.begin(), sorted.end());
@@ -247,7 +235,7 @@ void BM_CompositeInsert(benchmark::State& state) {
 
 void BM_PrefixWalk(benchmark::State& state) {
     const auto n = static_cast<std::size_t>(state.range(0));
-    const CompositeKeys& c = compositeKeys(n);
+    const CompositeSet& c = compositeKeys(n);
     kov::bench::runPaired(state, StoreSide::kName, [&](PairedRun& run) {
         std::vector<unsigned char> rawPayload(64);
         std::string storePayload;
@@ -257,12 +245,12 @@ void BM_PrefixWalk(benchmark::State& state) {
             Tally raw;
             Tally store;
             run.sides(
-                kGroups, kWalkChunk,
+                CompositeKeys::kGroups, kWalkChunk,
                 [&](std::size_t begin, std::size_t end) {
                     for (std::size_t g = begin; g < end; ++g) {
-                        const unsigned char* prefix = c.prefixes[c.walk[g]].data();
+                        const unsigned char* prefix = c.groups.walkPrefix(g);
                         set.rawTable.walkPrefix(
-                            prefix, kPrefixSize,
+                            prefix, CompositeKeys::kPrefixSize,
                             [&](const unsigned char* payload, std::size_t size) {
                                 if (size > rawPayload.size()) {
                                     throw std::runtime_error("raw walk: key larger than expected");
@@ -274,11 +262,12 @@ void BM_PrefixWalk(benchmark::State& state) {
                 },
                 [&](std::size_t begin, std::size_t end) {
                     for (std::size_t g = begin; g < end; ++g) {
-                        const unsigned char* prefix = c.prefixes[c.walk[g]].data();
-                        if (!cursor.indexKeySeek(prefix, kPrefixSize)) {
+                        const unsigned char* prefix = c.groups.walkPrefix(g);
+                        constexpr std::size_t kPrefix = CompositeKeys::kPrefixSize;
+                        if (!cursor.indexKeySeek(prefix, kPrefix)) {
                             continue;
                         }
-                        while (cursor.indexKeyFetch(prefix, kPrefixSize, storePayload)) {
+                        while (cursor.indexKeyFetch(prefix, kPrefix, storePayload)) {
                             store.add(prefix, storePayload.size(),
                                       reinterpret_cast<const unsigned char*>(storePayload.data()));
                             if (!cursor.next()) {
