@@ -348,29 +348,24 @@ class StoreProgram::Impl {
     }
 
     // Engine move-to on a model table: the smallest entry not below the key, else the largest.
-    static int moveInt(ModelSlot& s, ModelTable& t, std::int64_t k) {
-        auto it = t.ints.lower_bound(k);
-        if (it != t.ints.end()) {
-            s.on = true;
-            s.ik = it->first;
+    template <typename Map, typename Key>
+    static int moveIn(const Map& m, const Key& k, Key& at, bool& on) {
+        auto it = m.lower_bound(k);
+        if (it != m.end()) {
+            on = true;
+            at = it->first;
             return it->first == k ? 0 : 1;
         }
-        s.on = !t.ints.empty();
-        if (s.on)
-            s.ik = t.ints.rbegin()->first;
+        on = !m.empty();
+        if (on)
+            at = m.rbegin()->first;
         return -1;
     }
+    static int moveInt(ModelSlot& s, ModelTable& t, std::int64_t k) {
+        return moveIn(t.ints, k, s.ik, s.on);
+    }
     static int moveBytes(ModelSlot& s, ModelTable& t, const std::string& k) {
-        auto it = t.bytes.lower_bound(k);
-        if (it != t.bytes.end()) {
-            s.on = true;
-            s.bk = it->first;
-            return it->first == k ? 0 : 1;
-        }
-        s.on = !t.bytes.empty();
-        if (s.on)
-            s.bk = t.bytes.rbegin()->first;
-        return -1;
+        return moveIn(t.bytes, k, s.bk, s.on);
     }
 
     std::int64_t keySizeOf(ModelSlot& s) {
