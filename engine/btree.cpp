@@ -42,14 +42,17 @@
 #include "engine/btree.h"
 
 #include <cassert>
+#include <cstdint>
 #include <cstring>
 #include <memory>
+#include <new>
 #include <string>
 #include <unordered_map>
 #include <vector>
 
 // After engine/btree.h: its result codes share SQLite's macro names.
 #include "engine/private_sqlite3.h"
+#include "engine/sorted_load.h"
 #include "engine/sqlite_btree.h"
 
 namespace kov::engine {
@@ -61,6 +64,10 @@ constexpr std::int64_t kMaxLength = 1000000000;
 
 enum class Transaction { None, Read, Write };
 
+// How loads are gathered (engine/sorted_load.h); TEST_setLoadLimits changes it for the engines
+// opened after.
+LoadLimits gLoadLimits = kDefaultLoadLimits;
+
 }  // namespace
 
 struct Table {
@@ -69,6 +76,11 @@ struct Table {
     bool hasData = true;
     BtCursor* cursors = nullptr;  // open cursors, a list
     int readCursors = 0;
+    // Inserts since the table was last read; past LoadLimits::directInserts they are gathered.
+    std::uint32_t insertsSinceRead = 0;
+    std::unique_ptr<PendingLoad> pending;  // what is gathered and not merged; null when nothing
+
+    TableShape shape() const { return TableShape{intKey, hasData}; }
 };
 
 struct Btree {
@@ -82,6 +94,13 @@ struct Btree {
     const char* failureOperation = "";  // what the engine was doing then
     Btree* nextOpen = nullptr;  // the list of open engines
     bool pageSizeFixed = false;
+    LoadLimits limits = kDefaultLoadLimits;
+    std::size_t gathered = 0;  // bytes held by the load buffers of every table
+    // Run B-trees: every one made (for the integrity check), and the empty ones ready for the
+    // next run, by layout ([1] integer keys).
+    std::vector<std::uint32_t> runTrees;
+    std::vector<std::uint32_t> freeRuns[2];
+    LoadStats stats;
 };
 
 struct BtCursor {
@@ -91,6 +110,11 @@ struct BtCursor {
     bool write = false;
     bool onEntry = false;
     bool described = false;
+    // Where the last move, a search, left SQLite's cursor for an insert of the key it searched
+    // (a KOVSQ_ position; KOVSQ_SEARCH when the cursor has moved since, or cannot tell).
+    int seekAt = KOVSQ_SEARCH;
+    std::int64_t seekIntKey = 0;
+    std::string seekKey;
     KovsqEntry entry{};
     std::string keyCopy;  // a key that does not lie whole on its page
     BtCursor* prev = nullptr;  // neighbours on the table's list
@@ -168,6 +192,7 @@ Btree* gOpenEngines = nullptr;
 void leaveEntry(BtCursor* cur) {
     cur->onEntry = false;
     cur->described = false;
+    cur->seekAt = KOVSQ_SEARCH;
 }
 
 // The cursor after a move that returned `rc`: on an entry exactly when the
@@ -175,6 +200,7 @@ void leaveEntry(BtCursor* cur) {
 // cursor on no entry.
 int afterMove(BtCursor* cur, int rc) {
     cur->described = false;
+    cur->seekAt = KOVSQ_SEARCH;
     if (isFailure(rc)) {
         kovsq_clear(cur->cursor);
         cur->onEntry = false;
@@ -257,7 +283,168 @@ int checkByteKey(const void* pKey, std::int64_t nKey) {
 
 bool validPageSize(int size) { return size >= 512 && size <= 32768 && (size & (size - 1)) == 0; }
 
+// --- Loads (engine/sorted_load.h) ---
+
+constexpr const char* kInserting = "inserting an entry";
+
+// Keys longer than this are not remembered for the insert after a search (it searches again).
+constexpr std::int64_t kRememberedKeyLimit = 1024;
+
+// An empty run tree of the given layout: one kept from an earlier run, or a new one.
+int takeRunTree(Btree* bt, bool intKey, std::uint32_t* root) {
+    std::vector<std::uint32_t>& pool = bt->freeRuns[intKey ? 1 : 0];
+    if (!pool.empty()) {
+        *root = pool.back();
+        pool.pop_back();
+        return SQLITE_OK;
+    }
+    int rc = kovsq_create_table(bt->tree, root, intKey ? 1 : 0);
+    if (rc == SQLITE_OK)
+        bt->runTrees.push_back(*root);
+    return rc;
+}
+
+// Empties the load's run trees and keeps them for later runs. After a failure nothing is written
+// any more: the trees keep what they hold, unused.
+void releaseRuns(Btree* bt, PendingLoad& load, bool intKey) {
+    for (std::uint32_t root : load.runs) {
+        if (!bt->writable)
+            break;
+        int rc = noteFailure(bt, kovsq_clear_table(bt->tree, root), kInserting);
+        if (rc == SQLITE_OK)
+            bt->freeRuns[intKey ? 1 : 0].push_back(root);
+    }
+    load.runs.clear();
+}
+
+// Takes what the table has gathered away from it, and its buffer out of the engine's count.
+std::unique_ptr<PendingLoad> takePending(Btree* bt, Table* t) {
+    std::unique_ptr<PendingLoad> load = std::move(t->pending);
+    if (load != nullptr)
+        bt->gathered -= load->buffer.bytes();
+    return load;
+}
+
+// Merges what the table has gathered into its B-tree. After a failure (now or before) what was
+// gathered is lost.
+int mergePending(Btree* bt, Table* t) {
+    std::unique_ptr<PendingLoad> load = takePending(bt, t);
+    if (load == nullptr)
+        return SQLITE_OK;
+    if (!bt->writable)
+        return SQLITE_ERROR;
+    load->buffer.sortUnique();
+    bool appended = false;
+    int rc = mergeInto(bt->tree, t->root, t->shape(), load->runs, load->buffer, &appended);
+    if (rc != SQLITE_OK)
+        return noteFailure(bt, rc, kInserting);
+    ++bt->stats.merges;
+    bt->stats.mergedByAppend += appended ? 1 : 0;
+    releaseRuns(bt, *load, t->intKey);
+    return SQLITE_OK;
+}
+
+// The table is about to be read: what it has gathered goes into its B-tree first. A failure is
+// kept (sqlite3BtreeFailure); the read goes on with what the B-tree holds.
+void settle(Btree* bt, Table* t) {
+    t->insertsSinceRead = 0;
+    mergePending(bt, t);
+}
+
+// Makes room in the engine's load memory: the largest buffer is written out as a run.
+int spillLargest(Btree* bt) {
+    Table* largest = nullptr;
+    for (const auto& entry : bt->tables) {
+        Table* t = entry.second.get();
+        if (t->pending != nullptr &&
+            (largest == nullptr || t->pending->buffer.bytes() > largest->pending->buffer.bytes()))
+            largest = t;
+    }
+    if (largest == nullptr || largest->pending->buffer.empty())
+        return SQLITE_OK;
+    PendingLoad& load = *largest->pending;
+    load.buffer.sortUnique();
+    // With no run before it, a buffer whose keys all lie above the table's goes into the table
+    // now, by appending, instead of into a run (a load in key order is written once).
+    bool appends = false;
+    int rc = SQLITE_OK;
+    if (load.runs.empty())
+        rc = appendsToTable(bt->tree, largest->root, largest->shape(), load.buffer, &appends);
+    if (rc == SQLITE_OK && appends) {
+        rc = mergeInto(bt->tree, largest->root, largest->shape(), load.runs, load.buffer, &appends);
+        ++bt->stats.merges;
+        ++bt->stats.mergedByAppend;
+    } else if (rc == SQLITE_OK) {
+        std::uint32_t root = 0;
+        rc = takeRunTree(bt, largest->intKey, &root);
+        if (rc == SQLITE_OK) {
+            load.runs.push_back(root);
+            rc = writeRun(bt->tree, root, largest->shape(), load.buffer);
+            ++bt->stats.runsWritten;
+        }
+    }
+    bt->gathered -= load.buffer.bytes();
+    load.buffer.clear();
+    return noteFailure(bt, rc, kInserting);
+}
+
+// Gathers one insert into the table's buffer, making room first when the engine's load memory is
+// full.
+int gather(Btree* bt, Table* t, const void* pKey, std::int64_t nKey, const void* pData,
+           std::uint32_t dataSize) {
+    const std::uint32_t keySize = t->intKey ? 0 : static_cast<std::uint32_t>(nKey);
+    const std::size_t need = LoadBuffer::footprint(keySize, dataSize);
+    if (bt->gathered + need > bt->limits.bufferBytes) {
+        int rc = spillLargest(bt);
+        if (rc != SQLITE_OK)
+            return rc;
+    }
+    try {
+        if (t->pending == nullptr)
+            t->pending = std::make_unique<PendingLoad>(t->intKey);
+        t->pending->buffer.add(nKey, pKey, keySize, pData, dataSize);
+    } catch (const std::bad_alloc&) {
+        return noteFailure(bt, SQLITE_NOMEM, kInserting);
+    }
+    bt->gathered += need;
+    ++bt->stats.gathered;
+    return SQLITE_OK;
+}
+
+// Remembers where a search for a key left the cursor, for an insert of that key.
+void rememberSeek(BtCursor* cur, const void* pKey, std::int64_t nKey, int at) {
+    if (cur->table->intKey) {
+        cur->seekIntKey = nKey;
+    } else if (nKey <= kRememberedKeyLimit) {
+        cur->seekKey.assign(static_cast<const char*>(pKey), static_cast<std::size_t>(nKey));
+    } else {
+        return;
+    }
+    cur->seekAt = at;
+}
+
+// Where an insert of this key through this cursor goes without searching again: next to where
+// the cursor's last search left it, when nothing moved it since and the key is the one searched.
+int rememberedPosition(const BtCursor* cur, const void* pKey, std::int64_t nKey) {
+    if (!cur->onEntry || cur->seekAt == KOVSQ_SEARCH)
+        return KOVSQ_SEARCH;
+    const bool same = cur->table->intKey
+                          ? cur->seekIntKey == nKey
+                          : static_cast<std::int64_t>(cur->seekKey.size()) == nKey &&
+                                (nKey == 0 || std::memcmp(cur->seekKey.data(), pKey,
+                                                          static_cast<std::size_t>(nKey)) == 0);
+    return same ? cur->seekAt : KOVSQ_SEARCH;
+}
+
 }  // namespace
+
+LoadStats TEST_loadStats(Btree* p) { return p == nullptr ? LoadStats{} : p->stats; }
+
+LoadLimits TEST_setLoadLimits(LoadLimits limits) {
+    LoadLimits previous = gLoadLimits;
+    gLoadLimits = limits;
+    return previous;
+}
 
 char*& temporaryDirectorySetting() { return *kovsq_temp_directory(); }
 
@@ -287,6 +474,7 @@ int sqlite3BtreeOpen(const char* filename, sqlite3* db, Btree** ppBtree, int fla
         sqlite3_close(bt->db);
         return rc;
     }
+    bt->limits = gLoadLimits;
     bt->nextOpen = gOpenEngines;
     gOpenEngines = bt.get();
     *ppBtree = bt.release();
@@ -413,8 +601,10 @@ int sqlite3BtreeIntegrityCheck(Btree* p, int maxErrors, int* pnErr, std::string*
     *pnErr = 0;
     if (p->transaction != Transaction::Write)
         return SQLITE_OK;  // nothing was ever written
-    std::vector<std::uint32_t> roots;
-    roots.reserve(p->tables.size());
+    // Everything gathered is merged first: the check reads every table.
+    for (const auto& entry : p->tables)
+        settle(p, entry.second.get());
+    std::vector<std::uint32_t> roots = p->runTrees;
     for (const auto& entry : p->tables)
         roots.push_back(entry.first);
     char* text = nullptr;
@@ -472,6 +662,9 @@ int sqlite3BtreeDropTable(Btree* p, std::uint32_t iTable, int* piMoved) {
     auto found = p->tables.find(iTable);
     if (found == p->tables.end())
         return SQLITE_ERROR;
+    // What the table gathered goes with it.
+    if (std::unique_ptr<PendingLoad> load = takePending(p, found->second.get()))
+        releaseRuns(p, *load, found->second->intKey);
     int rc = kovsq_drop_table(p->tree, iTable);
     if (rc != SQLITE_OK)
         return noteFailure(p, rc, "dropping a table");  // its root page still exists
@@ -494,6 +687,9 @@ int sqlite3BtreeCursor(Btree* p, std::uint32_t iTable, int wrFlag, BtreeCompare 
     Table* t = found->second.get();
     if (wrFlag != 0 && t->readCursors > 0)
         return SQLITE_LOCKED;
+    // A read cursor locks writers out: what the table gathered goes into it now.
+    if (wrFlag == 0)
+        settle(p, t);
 
     auto cur = std::make_unique<BtCursor>();
     // Tables exist only inside the write transaction; SQLite's writing
@@ -536,6 +732,7 @@ int moveToEnd(BtCursor* pCur, int* pRes, Move move) {
         *pRes = 1;
         return SQLITE_OK;
     }
+    settle(pCur->bt, pCur->table);
     int empty = 1;
     int rc = afterMove(pCur, move(pCur->cursor, &empty));
     if (rc != SQLITE_OK)
@@ -589,6 +786,7 @@ int sqlite3BtreeMoveto(BtCursor* pCur, const void* pKey, std::int64_t nKey, int*
         if (refused != SQLITE_OK)
             return refused;
     }
+    settle(pCur->bt, pCur->table);
     int cmp = 0;
     int rc = pCur->table->intKey
                  ? kovsq_seek_int(pCur->cursor, nKey, &cmp)
@@ -600,21 +798,28 @@ int sqlite3BtreeMoveto(BtCursor* pCur, const void* pKey, std::int64_t nKey, int*
         *pRes = -1;  // an empty table
         return SQLITE_OK;
     }
+    // Where SQLite's search stopped is where an insert of the key goes (rememberSeek).
+    int at = cmp == 0 ? KOVSQ_AT_ENTRY : KOVSQ_BEFORE_ENTRY;
     if (cmp < 0) {
         // SQLite stopped on the smaller neighbour: land on the larger one
         // when there is one, else come back to the last entry.
-        rc = afterMove(pCur, kovsq_next(pCur->cursor));
+        int adjacent = 0;
+        rc = afterMove(pCur, kovsq_next_adjacent(pCur->cursor, &adjacent));
         if (isFailure(rc))
             return rc;
         if (pCur->onEntry) {
             cmp = 1;
+            at = adjacent ? KOVSQ_BEFORE_ENTRY : KOVSQ_SEARCH;
         } else {
             int empty = 1;
             rc = afterMove(pCur, kovsq_last(pCur->cursor, &empty));
             if (rc != SQLITE_OK)
                 return rc;
+            at = KOVSQ_AFTER_ENTRY;
         }
     }
+    if (pCur->onEntry && at != KOVSQ_SEARCH)
+        rememberSeek(pCur, pKey, nKey, at);
     *pRes = cmp;
     return SQLITE_OK;
 }
@@ -724,29 +929,51 @@ int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, cons
     if (pData == nullptr && nData > 0)
         return SQLITE_MISUSE;
     const std::uint32_t dataSize = t->hasData ? static_cast<std::uint32_t>(nData) : 0;
+    const std::uint32_t keySize = t->intKey ? 0 : static_cast<std::uint32_t>(nKey);
+
+    // Past the first few inserts since the table was read, inserts are gathered; an entry too
+    // large to gather goes straight in.
+    const bool gathering = t->insertsSinceRead >= bt->limits.directInserts &&
+                           LoadBuffer::footprint(keySize, dataSize) <= bt->limits.bufferBytes / 4;
+    if (t->insertsSinceRead < UINT32_MAX)
+        ++t->insertsSinceRead;
+    int at = gathering ? KOVSQ_SEARCH : rememberedPosition(pCur, pKey, nKey);
 
     // Every cursor on the table leaves its entry: their positions are
     // unspecified afterwards, and SQLite would otherwise save each one's key.
+    // The inserting cursor keeps SQLite's position unless the insert is
+    // gathered or a merge goes first, which write through cursors of their own.
+    const bool ownPosition = !gathering && t->pending == nullptr;
     for (BtCursor* c = t->cursors; c != nullptr; c = c->next) {
-        if (c != pCur)
+        if (c != pCur || !ownPosition)
             kovsq_clear(c->cursor);
         leaveEntry(c);
         assert(c == pCur || !kovsq_valid(c->cursor));  // invariant 3
+    }
+    if (gathering)
+        return gather(bt, t, pKey, nKey, pData, dataSize);
+    if (t->pending != nullptr) {
+        // What was gathered goes in first, so that this newer entry wins over an equal key.
+        int rc = mergePending(bt, t);
+        if (rc != SQLITE_OK)
+            return rc;
+        at = KOVSQ_SEARCH;
     }
     // Empty data is handed on as zero bytes at a real address: SQLite copies
     // it with memcpy, which must not be given a null pointer.
     static const unsigned char kNothing = 0;
     const void* data = pData != nullptr ? pData : &kNothing;
+    bt->stats.insertsAfterSearch += at != KOVSQ_SEARCH ? 1 : 0;
     int rc;
     if (t->intKey) {
-        rc = kovsq_insert_int(pCur->cursor, nKey, data, dataSize);
+        rc = kovsq_insert_int(pCur->cursor, nKey, data, dataSize, at);
     } else {
-        rc = kovsq_insert_key(pCur->cursor, pKey, static_cast<std::uint32_t>(nKey), data, dataSize,
-                              t->hasData ? 1 : 0);
+        rc = kovsq_insert_key(pCur->cursor, pKey, keySize, data, dataSize, t->hasData ? 1 : 0,
+                              at);
     }
     if (isFailure(rc))
         kovsq_clear(pCur->cursor);  // SQLite may have left it faulted: on no entry, as the others
-    return noteFailure(bt, rc, "inserting an entry");
+    return noteFailure(bt, rc, kInserting);
 }
 
 }  // namespace kov::engine

@@ -70,6 +70,7 @@
 
 // Include this header before <sqlite3.h> where both are needed: the result
 // codes below share SQLite's macro names and values.
+#include <cstddef>
 #include <cstdint>
 #include <string>
 
@@ -238,6 +239,37 @@ int sqlite3BtreeData(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, vo
 // key-only table the data is not stored. Refused inserts change nothing.
 int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, const void* pData,
                        int nData);
+
+// Loads. Inserts into a table that nothing reads are not put into its B-tree one by one: they are
+// gathered in memory, written out in sorted runs when the memory set aside for that is full, and
+// merged into the B-tree in key order before the table is next read (engine/sorted_load.h). A
+// read is First, Last or Moveto on any cursor of the table, and opening a read cursor on it; every
+// other operation of a cursor on a table with gathered inserts finds it on no entry (rule 6).
+// IntegrityCheck merges every table first. The first `directInserts` inserts after a read go
+// straight into the B-tree, so a table read between its inserts is never gathered. None of this
+// changes what any operation returns; a failure while writing a run or merging is kept as a
+// failure of an insert ("inserting an entry"), and what was gathered and not yet merged is then
+// lost. DropTable and closing the engine discard what is gathered.
+struct LoadLimits {
+    std::size_t bufferBytes;      // memory for the buffers of all tables together
+    std::uint32_t directInserts;  // inserts after a read of the table that are not gathered
+};
+inline constexpr LoadLimits kDefaultLoadLimits{std::size_t{8} << 20, 16};
+
+// Test seam: the limits of every engine opened from now on (a tiny buffer reaches runs and merges
+// in a few entries); returns the previous ones.
+LoadLimits TEST_setLoadLimits(LoadLimits limits);
+
+// Test seam: what the engine's loads have done since it opened, so that tests can tell which
+// paths they reached.
+struct LoadStats {
+    std::uint64_t gathered = 0;         // inserts gathered in a load buffer
+    std::uint64_t runsWritten = 0;      // buffers written out as runs
+    std::uint64_t merges = 0;           // loads merged into their table
+    std::uint64_t mergedByAppend = 0;   // of those, merged by appending
+    std::uint64_t insertsAfterSearch = 0;  // inserts placed where the cursor's search stopped
+};
+LoadStats TEST_loadStats(Btree* p);
 
 // Test seam: the SQLite connection behind an engine handle (null for a
 // null handle), so tests can look at its settings and its file.

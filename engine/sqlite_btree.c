@@ -35,7 +35,12 @@
  *     btreeReleaseAllCursorPages,
  *     sqlite3BtreeFirst, sqlite3BtreeLast, sqlite3BtreeNext and
  *     sqlite3BtreePrevious (SQLITE_DONE at either end), sqlite3BtreeEof,
- *     sqlite3BtreeTableMoveto, sqlite3BtreeIndexMoveto, sqlite3BtreeInsert,
+ *     sqlite3BtreeTableMoveto, sqlite3BtreeIndexMoveto, sqlite3BtreeInsert
+ *     (its flags BTREE_SAVEPOSITION and BTREE_APPEND, and its seek result:
+ *     -1/+1 = the cursor stands on the leaf entry just before/after the new
+ *     one), sqlite3BtreeClearTable (keeps the root page),
+ *     sqlite3BtreeCursorHintFlags (BTREE_BULKLOAD: balancing fills pages
+ *     fully, for entries that arrive in key order), MemPage.leaf,
  *     getCellInfo and BtCursor.info (pPayload, nPayload, nLocal, nKey: the
  *     parsed current cell), MemPage.aDataEnd, sqlite3BtreePayload,
  *     sqlite3BtreeIntegrityCheck (returns the report, root page 1 included),
@@ -128,6 +133,10 @@ int kovsq_drop_table(KovsqTree *tree, uint32_t root) {
     return sqlite3BtreeDropTable(tree->btree, (int)root, &moved);
 }
 
+int kovsq_clear_table(KovsqTree *tree, uint32_t root) {
+    return sqlite3BtreeClearTable(tree->btree, (int)root, 0);
+}
+
 int kovsq_integrity_check(KovsqTree *tree, const uint32_t *roots, int nRoots, int maxErrors,
                           char **report) {
     Pgno *pages;
@@ -181,6 +190,22 @@ int kovsq_previous(KovsqCursor *cursor) { return sqlite3BtreePrevious(&cursor->c
 
 int kovsq_valid(KovsqCursor *cursor) { return !sqlite3BtreeEof(&cursor->cur); }
 
+/* Next's fast path leaves a leaf cursor on the same page with ix one higher;
+ * the entry it left and the one it reached are then neighbours on that leaf,
+ * and a key between them belongs right before the one reached. */
+int kovsq_next_adjacent(KovsqCursor *cursor, int *adjacent) {
+    BtCursor *cur = &cursor->cur;
+    MemPage *page = cur->eState == CURSOR_VALID ? cur->pPage : 0;
+    int onLeaf = page != 0 && page->leaf;
+    int rc = sqlite3BtreeNext(cur, 0);
+    *adjacent = onLeaf && rc == SQLITE_OK && cur->eState == CURSOR_VALID && cur->pPage == page;
+    return rc;
+}
+
+void kovsq_bulk_load(KovsqCursor *cursor, int on) {
+    sqlite3BtreeCursorHintFlags(&cursor->cur, on ? BTREE_BULKLOAD : 0);
+}
+
 /* Pitfall: sqlite3BtreeClearCursor only marks the cursor invalid. It keeps
  * its pages and, in curFlags, a claim that info.nKey is its current integer
  * key; an insert of that key through the cursor would then overwrite a cell
@@ -232,27 +257,65 @@ int kovsq_seek_key(KovsqCursor *cursor, const void *key, uint32_t keySize, int *
  * stands on the last entry (its search started on the current page, as in
  * kovsq_seek_key), and sqlite3BtreeLast then believes it and does not move.
  * The flag is dropped after every insert; the position is kept, so that the
- * next insert through the cursor can start from it. */
-static int insertPayload(KovsqCursor *cursor, const BtreePayload *payload) {
-    int rc = sqlite3BtreeInsert(&cursor->cur, payload, 0, 0);
-    cursor->cur.curFlags &= ~BTCF_AtLast;
+ * next insert through the cursor can start from it.
+ *
+ * `at` says where the entry goes (sqlite_btree.h): searched for, next to the
+ * cursor's entry as a search left it, in place of the cursor's entry, or after
+ * the last entry. A cursor that SQLite left needing a new search (a saved
+ * position) is cleared, which frees the key copy SQLite keeps for that. */
+static int insertPayload(KovsqCursor *cursor, const BtreePayload *payload, int at) {
+    BtCursor *cur = &cursor->cur;
+    int flags = 0, loc = 0, rc;
+    switch (at) {
+    case KOVSQ_AT_ENTRY:
+        /* The cell is parsed here so that SQLite sees the cursor on the equal
+         * entry: an integer key is then replaced where it stands, and an index
+         * entry of the same size is overwritten in place, neither searched
+         * for again. An index entry of another size is searched for, as
+         * SQLite's own replace does. */
+        if (cur->eState != CURSOR_VALID) break;
+        getCellInfo(cur);
+        if (cur->pKeyInfo != 0 && cur->info.nKey == payload->nKey) flags = BTREE_SAVEPOSITION;
+        break;
+    case KOVSQ_AT_END:
+        if (cur->eState != CURSOR_VALID) {
+            int empty = 1;
+            rc = sqlite3BtreeLast(cur, &empty);
+            if (rc != SQLITE_OK) return rc;
+        }
+        flags = BTREE_APPEND;
+        loc = -1;
+        break;
+    case KOVSQ_AFTER_ENTRY:
+        loc = -1;
+        break;
+    case KOVSQ_BEFORE_ENTRY:
+        loc = 1;
+        break;
+    default:
+        break;
+    }
+    rc = sqlite3BtreeInsert(cur, payload, flags, loc);
+    cur->curFlags &= ~BTCF_AtLast;
+    if (cur->eState == CURSOR_REQUIRESEEK) kovsq_clear(cursor);
     return rc;
 }
 
-int kovsq_insert_int(KovsqCursor *cursor, int64_t key, const void *data, uint32_t dataSize) {
+int kovsq_insert_int(KovsqCursor *cursor, int64_t key, const void *data, uint32_t dataSize,
+                     int at) {
     BtreePayload payload;
     memset(&payload, 0, sizeof(payload));
     payload.nKey = key;
     payload.pData = data;
     payload.nData = (int)dataSize;
-    return insertPayload(cursor, &payload);
+    return insertPayload(cursor, &payload, at);
 }
 
 /* The serial type of a BLOB of n bytes. */
 static sqlite3_uint64 blobType(uint32_t n) { return (sqlite3_uint64)n * 2 + 12; }
 
 int kovsq_insert_key(KovsqCursor *cursor, const void *key, uint32_t keySize, const void *data,
-                     uint32_t dataSize, int withData) {
+                     uint32_t dataSize, int withData, int at) {
     KovsqTree *tree = cursor->tree;
     sqlite3_uint64 bodySize = (sqlite3_uint64)keySize + (withData ? dataSize : 0);
     sqlite3_uint64 need = bodySize + KOVSQ_MAX_HEADER;
@@ -283,7 +346,7 @@ int kovsq_insert_key(KovsqCursor *cursor, const void *key, uint32_t keySize, con
     payload.nKey = (sqlite3_int64)(header + bodySize);
     payload.aMem = &field;
     payload.nMem = 1; /* equality on the key field alone: an equal key is replaced */
-    rc = insertPayload(cursor, &payload);
+    rc = insertPayload(cursor, &payload, at);
 
     if (tree->recordAlloc > KOVSQ_KEEP_BUFFER) {
         sqlite3_free(tree->record);

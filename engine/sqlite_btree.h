@@ -46,6 +46,10 @@ int kovsq_create_table(KovsqTree *tree, uint32_t *root, int intKey);
  * no open cursor. */
 int kovsq_drop_table(KovsqTree *tree, uint32_t root);
 
+/* Empties a table, keeping its root page (so it can be filled again). No
+ * cursor may stand on it. */
+int kovsq_clear_table(KovsqTree *tree, uint32_t root);
+
 /* SQLite's own integrity check of the whole file, given the root pages of
  * every table in it (the catalogue's page 1 is added here). Returns the
  * number of problems found (-1 when the check itself ran out of memory) and,
@@ -79,13 +83,42 @@ void kovsq_clear(KovsqCursor *cursor);
 int kovsq_seek_int(KovsqCursor *cursor, int64_t key, int *cmp);
 int kovsq_seek_key(KovsqCursor *cursor, const void *key, uint32_t keySize, int *cmp);
 
+/* Where an insert puts its entry:
+ *   KOVSQ_SEARCH        wherever a search for its key leads (the cursor's
+ *                       position does not matter);
+ *   KOVSQ_AT_ENTRY      in place of the entry the cursor stands on, which a
+ *                       search found equal to the key (no second search);
+ *   KOVSQ_AFTER_ENTRY   right after the cursor's entry, KOVSQ_BEFORE_ENTRY
+ *                       right before it: the cursor stands on a leaf where a
+ *                       search for the key left it (or on the leaf neighbour
+ *                       that kovsq_next_adjacent reached from there);
+ *   KOVSQ_AT_END        after the table's last entry: the key is larger than
+ *                       every key in the table (loads in key order). */
+enum {
+    KOVSQ_SEARCH = 0,
+    KOVSQ_AT_ENTRY = 1,
+    KOVSQ_AFTER_ENTRY = 2,
+    KOVSQ_BEFORE_ENTRY = 3,
+    KOVSQ_AT_END = 4
+};
+
 /* Inserts or replaces one entry. Afterwards the cursor's position is
  * SQLite's (use kovsq_valid only after a move). `key` must not be null;
  * `data` may be null when dataSize is 0. withData 0 stores no data field
- * (key-only tables). */
-int kovsq_insert_int(KovsqCursor *cursor, int64_t key, const void *data, uint32_t dataSize);
+ * (key-only tables). `at` as above; a wrong promise there damages the table. */
+int kovsq_insert_int(KovsqCursor *cursor, int64_t key, const void *data, uint32_t dataSize,
+                     int at);
 int kovsq_insert_key(KovsqCursor *cursor, const void *key, uint32_t keySize, const void *data,
-                     uint32_t dataSize, int withData);
+                     uint32_t dataSize, int withData, int at);
+
+/* Next, also telling whether the entry reached is the leaf neighbour of the
+ * one left (same leaf page): *adjacent is then 1, and an insert of a key
+ * between the two may use KOVSQ_BEFORE_ENTRY. */
+int kovsq_next_adjacent(KovsqCursor *cursor, int *adjacent);
+
+/* Tells SQLite that the cursor's inserts come in key order (on) or not (off):
+ * balancing then fills the pages it splits instead of halving them. */
+void kovsq_bulk_load(KovsqCursor *cursor, int on);
 
 /* The entry a cursor is on. The payload is the data on an integer-keyed
  * table and the record on the others; `local` points at the first

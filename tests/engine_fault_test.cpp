@@ -27,6 +27,7 @@
 #include <vector>
 
 #include "engine/btree.h"
+#include "engine_test_util.h"
 #include "fault_vfs.h"
 #include "kov_test_access.h"
 
@@ -79,6 +80,9 @@ struct Walk {
 
 // One engine opened and used the way the store uses it, with the model of
 // what each table should hold (the records whose insert reported success).
+//
+// Inserts go straight into the B-trees here, each insert meeting the faults
+// itself; the gathered path has its own tests (engine_load_fault_test.cpp).
 class Store {
   public:
     Store() {
@@ -96,6 +100,8 @@ class Store {
     ~Store() { close(); }
     Store(const Store&) = delete;
     Store& operator=(const Store&) = delete;
+
+    kov::engine::test::ScopedLoadLimits straight{kov::engine::test::kStraightLoads};
 
     bool ready() const {
         return bt != nullptr && openRc == SQLITE_OK && beginRc == SQLITE_OK &&

@@ -4,6 +4,12 @@
 // the temporary file and come back). Every answer is compared with std::map models; the binding
 // must also leave a database that SQLite's own integrity check passes.
 //
+// Steps include bursts of inserts through one cursor (so that, with loads gathered, buffers fill,
+// runs are written and merged) and reads-modify-writes (a search, then an insert of the key
+// searched through the same cursor, which goes where the search stopped without searching again).
+// The same runs are made with every insert straight into its B-tree and with a load buffer of a
+// few entries.
+//
 // KOV_ENGINE_MODEL_SEEDS=N runs N seeds instead of the default 40.
 #include <gtest/gtest.h>
 
@@ -67,9 +73,13 @@ class EngineModelRun {
         for (auto& c : cursors_)
             c.reset();
         EXPECT_EQ(integrityProblems(engine_.get()), "") << where();
+        stats_ = TEST_loadStats(engine_.get());
         for (int t = 0; t < kTables; ++t)
             expectTableMatches(t);
     }
+
+    // What the engine's loads did in the run.
+    const LoadStats& stats() const { return stats_; }
 
   private:
     std::string where() const {
@@ -109,27 +119,35 @@ class EngineModelRun {
         BtCursor* cur = cursors_[c]->get();
         ModelCursor& m = mc_[c];
         ModelTable& t = model_[m.table];
-        switch (rng_() % 10) {
+        switch (rng_() % 12) {
             case 0:
             case 1:
-            case 8: {  // insert
+            case 8:  // insert
+                insertRandom(cur, m);
+                break;
+            case 9: {  // a burst of inserts
+                const int n = 1 + static_cast<int>(rng_() % 60);
+                for (int i = 0; i < n && !::testing::Test::HasFatalFailure(); ++i)
+                    insertRandom(cur, m);
+                break;
+            }
+            case 10: {  // read, modify, write: a search, then an insert of the key searched
+                lastOp_ = " after a search and an insert of its key";
+                std::string d = randomData();
                 int rc;
                 if (t.intKey) {
-                    std::int64_t k = randomInt();
-                    std::string d = randomData();
+                    const std::int64_t k = randomInt();
+                    seekInt(cur, k);
                     rc = insertInt(cur, k, d);
                     t.ints[k] = d;
                 } else {
-                    std::string k = randomKey();
-                    std::string d = randomData();
+                    const std::string k = randomKey();
+                    seekBytes(cur, k);
                     rc = insertBytes(cur, k, d);
                     t.bytes[k] = t.hasData ? d : std::string();
                 }
-                ASSERT_EQ(rc, SQLITE_OK) << where() << "insert";
-                for (auto& other : mc_) {
-                    if (other.table == m.table)
-                        other.on = false;
-                }
+                ASSERT_EQ(rc, SQLITE_OK) << where() << "insert after a search";
+                leaveTable(m.table);
                 break;
             }
             case 2: {  // seek: the larger neighbour when there is one, else the last entry
@@ -188,6 +206,32 @@ class EngineModelRun {
                 break;
         }
         expectPosition(c);
+    }
+
+    void insertRandom(BtCursor* cur, const ModelCursor& m) {
+        ModelTable& t = model_[m.table];
+        int rc;
+        if (t.intKey) {
+            std::int64_t k = randomInt();
+            std::string d = randomData();
+            rc = insertInt(cur, k, d);
+            t.ints[k] = d;
+        } else {
+            std::string k = randomKey();
+            std::string d = randomData();
+            rc = insertBytes(cur, k, d);
+            t.bytes[k] = t.hasData ? d : std::string();
+        }
+        ASSERT_EQ(rc, SQLITE_OK) << where() << "insert";
+        leaveTable(m.table);
+    }
+
+    // After an insert into a table every cursor on it is on no entry.
+    void leaveTable(int table) {
+        for (auto& other : mc_) {
+            if (other.table == table)
+                other.on = false;
+        }
     }
 
     // kind: 0 equal, 2 on the larger neighbour, 1 no larger one (on the last entry, or on none in
@@ -272,6 +316,7 @@ class EngineModelRun {
     ModelTable model_[kTables];
     std::unique_ptr<TestCursor> cursors_[kCursors];
     ModelCursor mc_[kCursors];
+    LoadStats stats_;
 };
 
 int seedCount() {
@@ -283,15 +328,54 @@ int seedCount() {
 
 }  // namespace
 
-TEST(EngineModel, RandomCursorsOnEveryTableKindMatchTheModel) {
+namespace {
+
+// Runs every seed; returns what the loads did over all of them.
+LoadStats runSeeds(const LoadLimits& limits) {
+    ScopedLoadLimits loads(limits);
+    LoadStats sum;
     const int seeds = seedCount();
     for (int seed = 1; seed <= seeds; ++seed) {
-        EngineModelRun(static_cast<std::uint32_t>(seed)).run(3000);
+        EngineModelRun run(static_cast<std::uint32_t>(seed));
+        run.run(3000);
         if (::testing::Test::HasFailure()) {
             ADD_FAILURE() << "first failing seed: " << seed;
-            return;
+            return sum;
         }
+        sum.gathered += run.stats().gathered;
+        sum.runsWritten += run.stats().runsWritten;
+        sum.merges += run.stats().merges;
+        sum.mergedByAppend += run.stats().mergedByAppend;
+        sum.insertsAfterSearch += run.stats().insertsAfterSearch;
     }
+    return sum;
+}
+
+}  // namespace
+
+TEST(EngineModel, RandomCursorsOnEveryTableKindMatchTheModel) {
+    const LoadStats stats = runSeeds(kStraightLoads);
+    EXPECT_EQ(stats.gathered, 0u);
+    EXPECT_GT(stats.insertsAfterSearch, 0u);
+}
+
+// The same programs with a load buffer of about a kilobyte: inserts are gathered from the second
+// one after a read of their table, runs of a few entries are written and merged at the next read,
+// into empty tables and full ones.
+TEST(EngineModel, GatheredLoadsMatchTheModel) {
+    const LoadStats stats = runSeeds(kTinyLoads);
+    EXPECT_GT(stats.gathered, 0u);
+    EXPECT_GT(stats.runsWritten, 0u);
+    EXPECT_GT(stats.merges, stats.mergedByAppend);
+    EXPECT_GT(stats.mergedByAppend, 0u);
+    EXPECT_GT(stats.insertsAfterSearch, 0u);
+}
+
+// And with the store's own limits: bursts are gathered and merged, never spilled as runs.
+TEST(EngineModel, DefaultLoadLimitsMatchTheModel) {
+    const LoadStats stats = runSeeds(kDefaultLoadLimits);
+    EXPECT_GT(stats.merges, 0u);
+    EXPECT_EQ(stats.runsWritten, 0u);
 }
 
 // A cursor that stood on an integer key, was taken off it by another cursor's insert into the

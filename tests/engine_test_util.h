@@ -14,6 +14,25 @@
 
 namespace kov::engine::test {
 
+// Sets how the engines opened from now on gather their loads (engine/btree.h, Loads), for as
+// long as it lives.
+class ScopedLoadLimits {
+  public:
+    explicit ScopedLoadLimits(LoadLimits limits) : previous_(TEST_setLoadLimits(limits)) {}
+    ~ScopedLoadLimits() { TEST_setLoadLimits(previous_); }
+    ScopedLoadLimits(const ScopedLoadLimits&) = delete;
+    ScopedLoadLimits& operator=(const ScopedLoadLimits&) = delete;
+
+  private:
+    LoadLimits previous_;
+};
+
+// Every insert straight into its B-tree, as before loads were gathered.
+constexpr LoadLimits kStraightLoads{kDefaultLoadLimits.bufferBytes, UINT32_MAX};
+// A buffer of a few entries, gathered from the second insert after a read: runs and merges
+// within a few dozen inserts.
+constexpr LoadLimits kTinyLoads{1024, 1};
+
 // Table kinds as the store creates them.
 constexpr int kByteTable = 0;                             // byte-string key with data
 constexpr int kIntTable = BTREE_INTKEY | BTREE_LEAFDATA;  // integer key with data

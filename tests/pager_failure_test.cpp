@@ -133,6 +133,9 @@ TEST_F(StoreTest, EngineThatCannotBeOpened) {
 // failed() turns true and failure() names the insert and the engine's message; every later
 // insert is refused, another table reads back whole, and reset() gives a working store again.
 TEST_F(StoreTest, OutOfMemoryInsideTheEngine) {
+    // Inserts straight into the B-tree: each one meets the memory cap itself.
+    kov::engine::test::ScopedLoadLimits straight{kov::engine::test::kStraightLoads};
+    KovPager::instance()->reset();
     KovBtree kept(KovBtree::IntKeyTable);
     KovBtree grown(KovBtree::IntKeyTable);
     KovBtreeCursor keeper(kept, true);

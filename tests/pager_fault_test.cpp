@@ -38,6 +38,8 @@ ProgramOptions bigRecords() {
     o.wideKeys = true;
     o.destroyTablePercent = 0;
     o.readerPercent = 5;
+    // Inserts straight into the B-trees: each one meets the faults itself.
+    o.loads = kov::engine::test::kStraightLoads;
     return o;
 }
 

@@ -11,13 +11,15 @@
 #include <utility>
 
 #include "engine/btree.h"
+#include "engine_test_util.h"
 #include "kov_test_access.h"
 
 namespace kovtest {
 
 class StoreProgram::Impl {
   public:
-    Impl(ChoiceSource& choices, ProgramOptions options) : in_(choices), opt_(std::move(options)) {}
+    Impl(ChoiceSource& choices, ProgramOptions options)
+        : in_(choices), opt_(std::move(options)), loads_(opt_.loads) {}
 
     ~Impl() {
         clearHost();
@@ -1162,6 +1164,7 @@ class StoreProgram::Impl {
 
     ChoiceSource& in_;
     ProgramOptions opt_;
+    kov::engine::test::ScopedLoadLimits loads_;
     int step_ = 0;
     std::uint64_t operations_ = 0;
     std::string last_;

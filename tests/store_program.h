@@ -46,6 +46,8 @@
 #include <string>
 #include <vector>
 
+#include "engine/btree.h"
+
 namespace kovtest {
 
 // Where a program takes its choices from.
@@ -123,6 +125,9 @@ struct ProgramOptions {
     bool trace = false;
     // Called after a table creation opened a fresh engine.
     std::function<void()> onEngineOpened;
+    // How the engines the program opens gather their loads (engine/btree.h, Loads): in force
+    // from the program's construction to its destruction.
+    kov::engine::LoadLimits loads = kov::engine::kDefaultLoadLimits;
 };
 
 // The options of a store fuzz target's input (tests/fuzz/store_fuzz.cpp) from its first byte:
