@@ -39,6 +39,8 @@
 #include <chrono>
 #include <cstdint>
 #include <cstdlib>
+#include <cmath>
+#include <cstdio>
 #include <cstring>
 #include <ctime>
 #include <stdexcept>
@@ -99,15 +101,28 @@ inline void putBigEndian(unsigned char* out, std::uint64_t v) {
     }
 }
 
-// n random 16-byte keys, the same for every run.
+// The i-th (from 0) of the random 16-byte keys of a seed: the generator's
+// draws 2i+1 and 2i+2, big-endian, made without the draws before them.
+inline Key16 keyAt(std::uint64_t seed, std::uint64_t i) {
+    Key16 k;
+    putBigEndian(k.data(), mix(seed + (2 * i + 1) * kGolden));
+    putBigEndian(k.data() + 8, mix(seed + (2 * i + 2) * kGolden));
+    return k;
+}
+
+// n random 16-byte keys, the same for every run: keyAt(seed, 0..n-1).
 inline std::vector<Key16> randomKeys(std::size_t n, std::uint64_t seed) {
-    Random random(seed);
     std::vector<Key16> keys(n);
-    for (Key16& k : keys) {
-        putBigEndian(k.data(), random.next());
-        putBigEndian(k.data() + 8, random.next());
+    for (std::size_t i = 0; i < n; ++i) {
+        keys[i] = keyAt(seed, i);
     }
     return keys;
+}
+
+// How many different keys `keys` holds.
+inline std::size_t distinctKeys(std::vector<Key16> keys) {
+    std::sort(keys.begin(), keys.end());
+    return static_cast<std::size_t>(std::unique(keys.begin(), keys.end()) - keys.begin());
 }
 
 // count indices drawn from [0, bound), the same for every run.
@@ -127,6 +142,8 @@ constexpr std::uint64_t kWorkloadKeySeed = 0x6b6f76;      // the N random 16-byt
 constexpr std::uint64_t kSeekSeed = 0x7365656b;           // which of them the seeks look for
 constexpr std::uint64_t kGroupPrefixSeed = 0x67726f7570;  // the composite keys' group prefixes
 constexpr std::uint64_t kPayloadSeed = 0x7061796c6f6164;  // their groups and payloads
+constexpr std::uint64_t kDrawSeed = 0x64726177;           // the counting workload's draws
+constexpr std::uint64_t kCountKeySeed = 0x636f756e74;     // and the keys they name
 
 // The N random keys of the workloads, made on first use and kept; entry i
 // of every table is keys[i] with Payload entry i.
@@ -173,6 +190,38 @@ class CompositeKeys {
     Random random_;
 };
 
+// The draws of the counting workload (W7, BM_CountDraws): N draws of
+// 16-byte keys from a skewed law over N distinct keys, a few drawn very often
+// and most rarely, each computed on its own from its index.
+//
+// Draw i (from 0) takes u, uniform in [0, 1), from the generator's draw i+1
+// of kDrawSeed, and the rank r = floor((N + 1)^u) - 1, in [0, N); its key is
+// keyAt(kCountKeySeed, r), so the hot keys lie anywhere in the key order. A
+// rank comes up with probability P(r) = ln((r + 2) / (r + 1)) / ln(N + 1),
+// about 1 / ((r + 1) ln N): Zipf's law with exponent 1. The hottest key takes
+// ln 2 / ln(N + 1) of the draws (6 % at N = 100 000, 5 % at 1 M), the ten
+// hottest ln 11 / ln(N + 1) (21 %, 17 %). The expected number of distinct
+// keys drawn, the sum over r of 1 - (1 - P(r))^N, is close to
+// (N / ln N)(1 + ln ln N - 0.577):
+//
+//     N        20 k    100 k   1 M     4 M     10 M
+//     keys     5.6 k   25 k    223 k   836 k   2.0 M   (about a fifth to a quarter of N)
+class SkewedDraws {
+  public:
+    explicit SkewedDraws(std::uint64_t n) : n_(n), logSpan_(std::log(static_cast<double>(n) + 1)) {}
+    std::uint64_t size() const { return n_; }
+    std::uint64_t rank(std::uint64_t i) const {
+        double u = static_cast<double>(mix(kDrawSeed + (i + 1) * kGolden) >> 11) * 0x1.0p-53;
+        auto r = static_cast<std::uint64_t>(std::floor(std::exp(u * logSpan_))) - 1;
+        return r < n_ ? r : n_ - 1;  // (N + 1)^u may round up to N + 1
+    }
+    Key16 at(std::uint64_t i) const { return keyAt(kCountKeySeed, rank(i)); }
+
+  private:
+    std::uint64_t n_;
+    double logSpan_;
+};
+
 // The 100-byte data of entry i: its index in the first 8 bytes, then a
 // fixed pattern.
 constexpr std::size_t kDataSize = 100;
@@ -208,8 +257,25 @@ struct Tally {
         ++rows;
         sum += entryOf(data) * 31 + (keySize > 0 ? key[0] : 0) + keySize;
     }
+    // A row of the counting workload: `sum` adds up the counts, to N.
+    void addCount(std::uint64_t count) {
+        ++rows;
+        sum += count;
+    }
     bool operator==(const Tally& other) const { return rows == other.rows && sum == other.sum; }
 };
+
+// The check every insert workload ends with, inside its timing: after the
+// last insert, the first entry in key order and the last key inserted were
+// read back. A store that gathers inserts and merges them on the next read
+// pays for that merge here, in the workload that caused it. A failed read
+// back means the store lost entries: no figure is worth reporting then.
+inline void requireReadable(bool readable, const char* who) {
+    if (!readable) {
+        std::fprintf(stderr, "%s: the inserted entries cannot be read back\n", who);
+        std::abort();
+    }
+}
 
 // Seconds of processor time the process has used (all its threads).
 inline double processCpuSeconds() {
@@ -337,6 +403,19 @@ class PairedRun {
     benchmark::State& state_;
     PairTimer timer_;
 };
+
+// A chunk function for PairedRun::sides over [0, count): work(begin, end),
+// and after the last chunk, inside that chunk's timing, atEnd() (an insert
+// workload's read back: requireReadable).
+template <class Work, class AtEnd>
+auto endingWith(std::size_t count, Work work, AtEnd atEnd) {
+    return [count, work, atEnd](std::size_t begin, std::size_t end) mutable {
+        work(begin, end);
+        if (end == count) {
+            atEnd();
+        }
+    };
+}
 
 // The frame of every paired benchmark: body(run) makes its tables and runs
 // the iterations; a failure skips the benchmark with its message, otherwise

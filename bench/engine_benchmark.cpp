@@ -11,7 +11,10 @@
 //   BM_RandomBlobInsert  N inserts of random 16-byte keys with 100-byte data
 //   BM_OrderedScan       a full ordered walk of the N random-key entries, key and data read
 //   BM_RandomSeek        N/10 seeks of existing random keys, data read
-// Inserts start from an empty table in a fresh database every iteration.
+//   BM_CountDraws        N draws of 16-byte keys from a skewed law, each key's count read
+//                        and written back plus one (raw: one upsert), then the counts walked
+// Inserts start from an empty table in a fresh database every iteration and end, inside the
+// timing, with the entries read back (the first entry and the last key inserted).
 // Counters: bind_ns and raw_ns, processor nanoseconds per operation; ratio =
 // bind / raw on processor time, wall_ratio the same on elapsed time. The Time
 // column is the binding's elapsed time per iteration.
@@ -41,6 +44,7 @@ using kov::bench::kDataSize;
 using kov::bench::Key16;
 using kov::bench::Payload;
 using kov::bench::RawBlobTable;
+using kov::bench::RawCountTable;
 using kov::bench::RawDatabase;
 using kov::bench::RawIntTable;
 using kov::bench::Tally;
@@ -83,13 +87,15 @@ class Engine {
     eng::Btree* p_ = nullptr;
 };
 
-// A raw byte-keyed table and an engine byte-keyed table side by side.
-struct BlobPair {
+// A raw table and an engine byte-keyed table side by side.
+template <class RawTable>
+struct TablePair {
     RawDatabase rawDb;
-    RawBlobTable rawTable{rawDb};
+    RawTable rawTable{rawDb};
     Engine engine;
     std::uint32_t root = engine.createTable(kBlobFlags);
 };
+using BlobPair = TablePair<RawBlobTable>;
 
 // A writing cursor, closed on destruction, with what the workloads do
 // through it.
@@ -98,7 +104,8 @@ class EngineCursor {
     EngineCursor(Engine& engine, std::uint32_t root) {
         check(eng::sqlite3BtreeCursor(engine.get(), root, 1, nullptr, nullptr, &c_), "cursor");
     }
-    explicit EngineCursor(BlobPair& set) : EngineCursor(set.engine, set.root) {}
+    template <class RawTable>
+    explicit EngineCursor(TablePair<RawTable>& set) : EngineCursor(set.engine, set.root) {}
     ~EngineCursor() { eng::sqlite3BtreeCloseCursor(c_); }
     EngineCursor(const EngineCursor&) = delete;
     EngineCursor& operator=(const EngineCursor&) = delete;
@@ -111,6 +118,22 @@ class EngineCursor {
         check(eng::sqlite3BtreeInsert(c_, key, static_cast<std::int64_t>(keySize), data,
                                       static_cast<int>(size)),
               "insert");
+    }
+
+    // The key's 8-byte count read when there, then count + 1 (or 1) inserted.
+    void increment(const Key16& key) {
+        std::uint64_t count = 0;
+        if (moveTo(key.data(), static_cast<std::int64_t>(key.size())) == 0) {
+            check(eng::sqlite3BtreeData(c_, 0, sizeof count, &count), "data");
+        }
+        ++count;
+        insert(key.data(), key.size(), reinterpret_cast<const unsigned char*>(&count),
+               sizeof count);
+    }
+
+    bool readable(std::int64_t key) { return step(false) && moveTo(nullptr, key) == 0; }
+    bool readable(const unsigned char* key, std::size_t keySize) {
+        return step(false) && moveTo(key, static_cast<std::int64_t>(keySize)) == 0;
     }
 
     bool step(bool started) {
@@ -134,11 +157,21 @@ class EngineCursor {
         tally.add(keyBuf.data(), static_cast<std::size_t>(keySize), dataBuf.data());
     }
 
+    void readCount(std::vector<unsigned char>& keyBuf, Tally& tally) {
+        std::int64_t keySize = 0;
+        check(eng::sqlite3BtreeKeySize(c_, &keySize), "key size");
+        if (static_cast<std::uint64_t>(keySize) > keyBuf.size()) {
+            throw std::runtime_error("engine walk: key larger than expected");
+        }
+        check(eng::sqlite3BtreeKey(c_, 0, static_cast<std::uint32_t>(keySize), keyBuf.data()),
+              "key");
+        std::uint64_t count = 0;
+        check(eng::sqlite3BtreeData(c_, 0, sizeof count, &count), "data");
+        tally.addCount(count);
+    }
+
     void seekEntry(const Key16& key, std::vector<unsigned char>& buffer, Tally& tally) {
-        int cmp = -1;
-        check(eng::sqlite3BtreeMoveto(c_, key.data(), static_cast<std::int64_t>(key.size()), &cmp),
-              "seek");
-        if (cmp != 0) {
+        if (moveTo(key.data(), static_cast<std::int64_t>(key.size())) != 0) {
             return;
         }
         std::uint32_t dataSize = 0;
@@ -151,6 +184,14 @@ class EngineCursor {
     }
 
   private:
+    // Moves next to the key (bytes and length, or a null pointer and the
+    // integer key) and returns the comparison (engine/btree.h, rule 2).
+    int moveTo(const void* key, std::int64_t keySize) {
+        int cmp = -1;
+        check(eng::sqlite3BtreeMoveto(c_, key, keySize, &cmp), "seek");
+        return cmp;
+    }
+
     eng::BtCursor* c_ = nullptr;
 };
 
@@ -166,6 +207,7 @@ struct EngineSide {
 
     using BlobSet = BlobPair;
     using Cursor = EngineCursor;
+    using CountSet = TablePair<RawCountTable>;
 
     // A raw integer-keyed table and an engine one, in a database each.
     struct IntSet {

@@ -23,6 +23,16 @@
 //       8-byte prefix naming one of 1 000 groups, then an 8-byte payload),
 //       then rounds of every group walked by its prefix (the time is per
 //       entry walked)
+//   W7  read-modify-write counting: N draws of 16-byte keys from a skewed law
+//       over N distinct keys (bench_util.h, SkewedDraws: Zipf-like, about a
+//       fifth of the keys come up), each a lookup of the key's 8-byte count
+//       and a write of count + 1 (1 when absent); then one walk of the counts
+//       in key order, key and count read (the time is per draw, the walk
+//       included; the tally is the rows and the sum of the counts, N)
+// Every insert phase (W1..W3, the fills of W4..W6, W7's draws) ends, inside
+// its timing, with the entries read back: the first entry in key order and a
+// lookup of the last key inserted, which must be found. A backend that
+// defers work to the next read pays for it where the inserts caused it.
 // The read phase of W4..W6 is made again until it has taken 0.2 s of
 // processor time (once at least; the figure is per operation over all the
 // rounds). W4..W6 also report their fill phase (fill_ns_cpu / fill_ns_wall).
@@ -31,7 +41,8 @@
 // the measured phase (processor time is that of the whole process, so a
 // backend's own background threads are charged to it), that processor time
 // split into user and kernel time, the read and write system calls per
-// operation and the bytes they moved (/proc/self/io), the peak resident
+// operation and the bytes they moved (/proc/self/io), the same for the fill
+// phase of W4..W6 (fill_...; zeros elsewhere), the peak resident
 // set (getrusage ru_maxrss), the scratch disk in use at the end (allocated
 // bytes of the files under the scratch directory, including the unlinked
 // temporary file SQLite keeps open), and the read tally (rows, sum), which
@@ -45,6 +56,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cstdint>
 #include <cstdio>
 #include <cstdlib>
@@ -74,6 +86,7 @@ using kov::bench::Tally;
 using kov::peers::CompositeKeys;
 using kov::peers::RandomKeys;
 using kov::peers::Shuffle;
+using kov::peers::SkewedDraws;
 
 // What the process has used so far: processor time (also split into user
 // and kernel time), elapsed time on the steady clock, and its I/O system
@@ -183,6 +196,16 @@ std::uint64_t diskInUse(const std::string& dir) {
 
 // ---- workloads ----
 
+// The end of every insert phase: the entries read back (bench_util.h).
+template <class Backend>
+void readBack(Backend& b, std::int64_t lastKey) {
+    kov::bench::requireReadable(b.readable(lastKey), Backend::kName);
+}
+template <class Backend>
+void readBack(Backend& b, const Key16& lastKey) {
+    kov::bench::requireReadable(b.readable(lastKey.data(), lastKey.size()), Backend::kName);
+}
+
 template <class Backend>
 void fillRandom(Backend& b, std::uint64_t n) {
     b.beginBlob();
@@ -192,6 +215,7 @@ void fillRandom(Backend& b, std::uint64_t n) {
         Key16 k = keys.at(i);
         b.blobInsert(k.data(), k.size(), data.forEntry(i), kDataSize);
     }
+    readBack(b, keys.at(n - 1));
 }
 
 // The read phase of W4..W6, made again until it has taken kMinReadSeconds of
@@ -222,10 +246,12 @@ Result runWorkload(Backend& b, const std::string& workload, std::uint64_t n,
         Shuffle order(n);
         bool shuffled = workload == "W2";
         Usage start = Usage::now();
+        std::uint64_t key = 0;
         for (std::uint64_t i = 0; i < n; ++i) {
-            std::uint64_t key = shuffled ? order.at(i) : i;
+            key = shuffled ? order.at(i) : i;
             b.intInsert(static_cast<std::int64_t>(key), data.forEntry(key), kDataSize);
         }
+        readBack(b, static_cast<std::int64_t>(key));
         r.ops = n;
         r.measured = Usage::perOp(start, Usage::now(), n);
     } else if (workload == "W3") {
@@ -239,7 +265,8 @@ Result runWorkload(Backend& b, const std::string& workload, std::uint64_t n,
         Usage filled = Usage::now();
         r.fill = Usage::perOp(start, filled, n);
         r.ops = repeatReads(r.tally, [&](Tally& tally) {
-            b.scan(tally);
+            b.scan([&](const unsigned char* key, std::size_t keySize, const unsigned char* data,
+                       std::size_t /*dataSize: 100*/) { tally.add(key, keySize, data); });
             return tally.rows;
         });
         r.measured = Usage::perOp(filled, Usage::now(), r.ops);
@@ -265,10 +292,12 @@ Result runWorkload(Backend& b, const std::string& workload, std::uint64_t n,
         b.beginKeys();
         CompositeKeys c;
         Usage start = Usage::now();
+        Key16 k{};
         for (std::uint64_t i = 0; i < n; ++i) {
-            Key16 k = c.next();
+            k = c.next();
             b.keyInsert(k.data(), k.size());
         }
+        readBack(b, k);
         Usage filled = Usage::now();
         r.fill = Usage::perOp(start, filled, n);
         r.ops = repeatReads(r.tally, [&](Tally& tally) {
@@ -279,8 +308,30 @@ Result runWorkload(Backend& b, const std::string& workload, std::uint64_t n,
             return walked;
         });
         r.measured = Usage::perOp(filled, Usage::now(), r.ops);
+    } else if (workload == "W7") {
+        b.beginCounts();
+        SkewedDraws draws(n);
+        Usage start = Usage::now();
+        Key16 k{};
+        for (std::uint64_t i = 0; i < n; ++i) {
+            k = draws.at(i);
+            b.increment(k.data(), k.size());
+        }
+        readBack(b, k);
+        b.scan([&](const unsigned char* /*key*/, std::size_t /*keySize*/,
+                   const unsigned char* count, std::size_t countSize) {
+            std::uint64_t c = 0;
+            std::memcpy(&c, count, std::min(countSize, sizeof c));
+            r.tally.addCount(c);
+        });
+        r.ops = n;
+        r.measured = Usage::perOp(start, Usage::now(), n);
+        if (r.tally.sum != n) {
+            throw std::runtime_error("W7: the counts add up to " + std::to_string(r.tally.sum) +
+                                     ", not " + std::to_string(n));
+        }
     } else {
-        throw std::runtime_error("unknown workload " + workload + " (W1..W6)");
+        throw std::runtime_error("unknown workload " + workload + " (W1..W7)");
     }
     r.diskBytes = diskInUse(scratch);
     return r;
@@ -336,7 +387,7 @@ std::string programDir(const char* argv0) {
 
 int usage() {
     std::fprintf(stderr,
-                 "usage: peers_benchmark --backend NAME --workload W1..W6 --n N [--scratch DIR]\n"
+                 "usage: peers_benchmark --backend NAME --workload W1..W7 --n N [--scratch DIR]\n"
                  "       peers_benchmark --list\n");
     return 2;
 }
@@ -415,12 +466,16 @@ int main(int argc, char** argv) {
             "\"ns_cpu\":%.1f,\"ns_wall\":%.1f,\"fill_ns_cpu\":%.1f,\"fill_ns_wall\":%.1f,"
             "\"ns_user\":%.1f,\"ns_sys\":%.1f,\"reads_per_op\":%.3f,\"writes_per_op\":%.3f,"
             "\"read_bytes_per_op\":%.0f,\"write_bytes_per_op\":%.0f,"
+            "\"fill_ns_user\":%.1f,\"fill_ns_sys\":%.1f,\"fill_reads_per_op\":%.3f,"
+            "\"fill_writes_per_op\":%.3f,\"fill_read_bytes_per_op\":%.0f,"
+            "\"fill_write_bytes_per_op\":%.0f,"
             "\"peak_rss_kib\":%ld,\"disk_bytes\":%llu,\"rows\":%llu,\"sum\":%llu,"
             "\"missing\":%llu}\n",
             backend.c_str(), workload.c_str(), static_cast<unsigned long long>(n),
             static_cast<unsigned long long>(r.ops), r.measured.cpu, r.measured.wall, r.fill.cpu,
             r.fill.wall, r.measured.user, r.measured.sys, r.measured.reads, r.measured.writes,
-            r.measured.readBytes, r.measured.writeBytes, usage.ru_maxrss,
+            r.measured.readBytes, r.measured.writeBytes, r.fill.user, r.fill.sys, r.fill.reads,
+            r.fill.writes, r.fill.readBytes, r.fill.writeBytes, usage.ru_maxrss,
             static_cast<unsigned long long>(r.diskBytes),
             static_cast<unsigned long long>(r.tally.rows),
             static_cast<unsigned long long>(r.tally.sum),

@@ -5,7 +5,8 @@
 // run, aborted at the end like the store's never-committed transaction.
 // Integer keys use MDB_INTEGERKEY (native 8-byte unsigned; the workloads'
 // keys are non-negative). The page cache is the kernel's: LMDB has no cache
-// size of its own.
+// size of its own. A count of the counting workload is read with mdb_get and
+// written with mdb_put, 8 bytes, in the one write transaction.
 #ifndef KOVPAGER_BENCH_PEERS_LMDB_H
 #define KOVPAGER_BENCH_PEERS_LMDB_H
 
@@ -49,6 +50,7 @@ class LmdbBackend {
     void beginInt() { open("ints", MDB_INTEGERKEY); }
     void beginBlob() { open("blobs", 0); }
     void beginKeys() { open("keys", 0); }
+    void beginCounts() { open("counts", 0); }
 
     void intInsert(std::int64_t key, const unsigned char* data, std::size_t size) {
         auto k = static_cast<std::uint64_t>(key);
@@ -67,8 +69,34 @@ class LmdbBackend {
         MDB_val dv{0, nullptr};
         check(mdb_put(txn_, dbi_, &kv, &dv, 0), "put");
     }
+    void increment(const unsigned char* key, std::size_t keySize) {
+        MDB_val kv{keySize, const_cast<unsigned char*>(key)};
+        MDB_val dv;
+        std::uint64_t count = 0;
+        int rc = mdb_get(txn_, dbi_, &kv, &dv);
+        if (rc == 0 && dv.mv_size == sizeof count) {
+            std::memcpy(&count, dv.mv_data, sizeof count);
+        } else if (rc != MDB_NOTFOUND) {
+            check(rc == 0 ? MDB_CORRUPTED : rc, "get");
+        }
+        ++count;
+        dv = MDB_val{sizeof count, &count};
+        check(mdb_put(txn_, dbi_, &kv, &dv, 0), "put");
+    }
 
-    void scan(kov::bench::Tally& tally) {
+    // A cursor on the first entry, and the key found.
+    bool readable(std::int64_t key) {
+        auto k = static_cast<std::uint64_t>(key);
+        return readBack(MDB_val{sizeof k, &k});
+    }
+    bool readable(const unsigned char* key, std::size_t keySize) {
+        return readBack(MDB_val{keySize, const_cast<unsigned char*>(key)});
+    }
+
+    // Every entry in key order, key and data copied out and handed to
+    // visit(key, keySize, data, dataSize).
+    template <class Visit>
+    void scan(Visit&& visit) {
         MDB_val kv;
         MDB_val dv;
         for (int rc = mdb_cursor_get(cursor(), &kv, &dv, MDB_FIRST); rc == 0;
@@ -77,7 +105,7 @@ class LmdbBackend {
             std::memcpy(key_.data(), kv.mv_data, kv.mv_size);
             data_.resize(dv.mv_size);
             std::memcpy(data_.data(), dv.mv_data, dv.mv_size);
-            tally.add(key_.data(), key_.size(), data_.data());
+            visit(key_.data(), key_.size(), data_.data(), data_.size());
         }
     }
 
@@ -113,6 +141,12 @@ class LmdbBackend {
     }
 
   private:
+    bool readBack(MDB_val key) {
+        MDB_val kv;
+        MDB_val dv;
+        return mdb_cursor_get(cursor(), &kv, &dv, MDB_FIRST) == 0 &&
+               mdb_get(txn_, dbi_, &key, &dv) == 0;
+    }
     void open(const char* name, unsigned flags) {
         check(mdb_dbi_open(txn_, name, MDB_CREATE | flags, &dbi_), "dbi_open");
     }

@@ -1,5 +1,6 @@
 // std::map: the in-memory ceiling. Everything lives in the heap, nothing
-// goes to disk; the data of every entry is a fixed 100-byte array.
+// goes to disk; the data of every entry is a fixed 100-byte array, a count
+// of the counting workload a std::uint64_t.
 #ifndef KOVPAGER_BENCH_PEERS_MAP_H
 #define KOVPAGER_BENCH_PEERS_MAP_H
 
@@ -22,9 +23,10 @@ class MapBackend {
 
     explicit MapBackend(const std::string& /*scratch: unused*/) {}
 
-    void beginInt() {}
-    void beginBlob() {}
-    void beginKeys() {}
+    void beginInt() { current_ = Table::kInts; }
+    void beginBlob() { current_ = Table::kBlobs; }
+    void beginKeys() { current_ = Table::kKeys; }
+    void beginCounts() { current_ = Table::kCounts; }
 
     void intInsert(std::int64_t key, const unsigned char* data, std::size_t size) {
         ints_.insert_or_assign(key, toData(data, size));
@@ -36,12 +38,48 @@ class MapBackend {
     void keyInsert(const unsigned char* key, std::size_t keySize) {
         keys_.insert(toKey(key, keySize));
     }
+    // A lookup, then the write: find and operator[].
+    void increment(const unsigned char* key, std::size_t keySize) {
+        Key16 k = toKey(key, keySize);
+        auto it = counts_.find(k);
+        std::uint64_t count = it == counts_.end() ? 1 : it->second + 1;
+        counts_[k] = count;
+    }
 
-    void scan(kov::bench::Tally& tally) {
+    // The table begun last has a first entry and holds the key.
+    bool readable(std::int64_t key) { return readBack(ints_, key); }
+    bool readable(const unsigned char* key, std::size_t keySize) {
+        Key16 k = toKey(key, keySize);
+        switch (current_) {
+            case Table::kBlobs:
+                return readBack(blobs_, k);
+            case Table::kKeys:
+                return readBack(keys_, k);
+            case Table::kCounts:
+                return readBack(counts_, k);
+            case Table::kInts:
+                break;
+        }
+        return false;
+    }
+
+    // The byte-keyed entries, or the counts once the counting workload has
+    // begun (each count handed over as its 8 bytes).
+    template <class Visit>
+    void scan(Visit&& visit) {
+        if (current_ == Table::kCounts) {
+            for (const auto& entry : counts_) {
+                Key16 key = entry.first;
+                std::uint64_t count = entry.second;
+                visit(key.data(), key.size(), reinterpret_cast<const unsigned char*>(&count),
+                      sizeof count);
+            }
+            return;
+        }
         for (const auto& entry : blobs_) {
             Key16 key = entry.first;
             Data data = entry.second;
-            tally.add(key.data(), key.size(), data.data());
+            visit(key.data(), key.size(), data.data(), data.size());
         }
     }
 
@@ -69,6 +107,13 @@ class MapBackend {
     }
 
   private:
+    enum class Table { kInts, kBlobs, kKeys, kCounts };
+
+    template <class Container, class Key>
+    static bool readBack(const Container& c, const Key& key) {
+        return c.begin() != c.end() && c.find(key) != c.end();
+    }
+
     // Keys are at most 16 bytes here; a shorter key is padded with zero bytes.
     static Key16 toKey(const unsigned char* key, std::size_t size) {
         Key16 k{};
@@ -84,6 +129,8 @@ class MapBackend {
     std::map<std::int64_t, Data> ints_;
     std::map<Key16, Data> blobs_;
     std::set<Key16> keys_;
+    std::map<Key16, std::uint64_t> counts_;
+    Table current_ = Table::kInts;
 };
 
 }  // namespace kov::peers

@@ -1,7 +1,7 @@
 // Hand-written SQLite with the store's settings (bench/raw_sqlite.h: a
 // private temporary database, the store's page size and page-cache size, no
 // journal, the exclusive lock, one transaction never committed, prepared
-// statements, INSERT OR REPLACE).
+// statements, INSERT OR REPLACE; the counting workload's upsert).
 #ifndef KOVPAGER_BENCH_PEERS_RAW_H
 #define KOVPAGER_BENCH_PEERS_RAW_H
 
@@ -26,14 +26,16 @@ class RawBackend {
         ints_.reset();
         blobs_.reset();
         keys_.reset();
+        counts_.reset();
         db_.reset();
     }
     RawBackend(const RawBackend&) = delete;
     RawBackend& operator=(const RawBackend&) = delete;
 
-    void beginInt() { ints_ = std::make_unique<kov::bench::RawIntTable>(*db_); }
-    void beginBlob() { blobs_ = std::make_unique<kov::bench::RawBlobTable>(*db_); }
-    void beginKeys() { keys_ = std::make_unique<kov::bench::RawKeyTable>(*db_); }
+    void beginInt() { current_ = begin(ints_); }
+    void beginBlob() { current_ = begin(blobs_); }
+    void beginKeys() { current_ = begin(keys_); }
+    void beginCounts() { current_ = begin(counts_); }
 
     void intInsert(std::int64_t key, const unsigned char* data, std::size_t size) {
         ints_->insert(key, data, size);
@@ -43,8 +45,27 @@ class RawBackend {
         blobs_->insert(key, keySize, data, dataSize);
     }
     void keyInsert(const unsigned char* key, std::size_t keySize) { keys_->insert(key, keySize); }
+    void increment(const unsigned char* key, std::size_t keySize) {
+        counts_->increment(key, keySize);
+    }
 
-    void scan(kov::bench::Tally& tally) {
+    // The table begun last reads back.
+    bool readable(std::int64_t key) { return current_->readable(key); }
+    bool readable(const unsigned char* key, std::size_t keySize) {
+        return current_->readable(key, keySize);
+    }
+
+    // The byte-keyed table or, once the counting workload has begun, the
+    // count table (each count handed over as its 8 bytes).
+    template <class Visit>
+    void scan(Visit&& visit) {
+        if (counts_ != nullptr) {
+            counts_->walk(key_, [&](const unsigned char* key, std::size_t keySize,
+                                    std::uint64_t count) {
+                visit(key, keySize, reinterpret_cast<const unsigned char*>(&count), sizeof count);
+            });
+            return;
+        }
         for (kov::bench::RawScan& s = blobs_->scan(); s.step();) {
             std::size_t keySize = s.bytes(0);
             key_.resize(keySize);
@@ -52,7 +73,7 @@ class RawBackend {
             std::size_t dataSize = s.bytes(1);
             data_.resize(dataSize);
             std::memcpy(data_.data(), s.blob(1), dataSize);
-            tally.add(key_.data(), keySize, data_.data());
+            visit(key_.data(), keySize, data_.data(), dataSize);
         }
     }
 
@@ -77,10 +98,18 @@ class RawBackend {
     }
 
   private:
+    template <class Table>
+    kov::bench::RawTable* begin(std::unique_ptr<Table>& table) {
+        table = std::make_unique<Table>(*db_);
+        return table.get();
+    }
+
     std::unique_ptr<kov::bench::RawDatabase> db_;
     std::unique_ptr<kov::bench::RawIntTable> ints_;
     std::unique_ptr<kov::bench::RawBlobTable> blobs_;
     std::unique_ptr<kov::bench::RawKeyTable> keys_;
+    std::unique_ptr<kov::bench::RawCountTable> counts_;
+    kov::bench::RawTable* current_ = nullptr;  // the table begun last
     std::vector<unsigned char> key_;
     std::vector<unsigned char> data_;
 };

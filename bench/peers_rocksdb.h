@@ -4,7 +4,8 @@
 // journal either). Integer keys are stored as 8 big-endian bytes so the
 // bytewise order is the numeric order (the workloads' keys are
 // non-negative). Background flushes and compactions run on RocksDB's own
-// threads; their processor time is part of the process's.
+// threads; their processor time is part of the process's. A count of the
+// counting workload is a Get and then a Put of 8 bytes.
 #ifndef KOVPAGER_BENCH_PEERS_ROCKSDB_H
 #define KOVPAGER_BENCH_PEERS_ROCKSDB_H
 
@@ -52,6 +53,7 @@ class RocksdbBackend {
     void beginInt() {}
     void beginBlob() {}
     void beginKeys() {}
+    void beginCounts() {}
 
     void intInsert(std::int64_t key, const unsigned char* data, std::size_t size) {
         unsigned char k[8];
@@ -65,28 +67,51 @@ class RocksdbBackend {
     void keyInsert(const unsigned char* key, std::size_t keySize) {
         check(db_->Put(write_, slice(key, keySize), rocksdb::Slice()), "put");
     }
+    void increment(const unsigned char* key, std::size_t keySize) {
+        std::uint64_t count = 0;
+        if (get(slice(key, keySize)) && value_.size() == sizeof count) {
+            std::memcpy(&count, value_.data(), sizeof count);
+        }
+        ++count;
+        check(db_->Put(write_, slice(key, keySize),
+                       slice(reinterpret_cast<const unsigned char*>(&count), sizeof count)),
+              "put");
+    }
 
-    void scan(kov::bench::Tally& tally) {
+    // A new iterator on the first entry (one made now sees every write so
+    // far), and the key found.
+    bool readable(std::int64_t key) {
+        unsigned char k[8];
+        kov::bench::putBigEndian(k, static_cast<std::uint64_t>(key));
+        return readable(k, sizeof k);
+    }
+    bool readable(const unsigned char* key, std::size_t keySize) {
+        std::unique_ptr<rocksdb::Iterator> it(db_->NewIterator(read_));
+        it->SeekToFirst();
+        check(it->status(), "first");
+        return it->Valid() && get(slice(key, keySize));
+    }
+
+    // Every entry in key order, key and data copied out and handed to
+    // visit(key, keySize, data, dataSize).
+    template <class Visit>
+    void scan(Visit&& visit) {
         rocksdb::Iterator* it = iterator();
         for (it->SeekToFirst(); it->Valid(); it->Next()) {
             rocksdb::Slice k = it->key();
             rocksdb::Slice v = it->value();
             key_.assign(k.data(), k.data() + k.size());
             data_.assign(v.data(), v.data() + v.size());
-            tally.add(reinterpret_cast<const unsigned char*>(key_.data()), key_.size(),
-                      reinterpret_cast<const unsigned char*>(data_.data()));
+            visit(reinterpret_cast<const unsigned char*>(key_.data()), key_.size(),
+                  reinterpret_cast<const unsigned char*>(data_.data()), data_.size());
         }
         check(it->status(), "scan");
     }
 
     bool seek(const unsigned char* key, std::size_t keySize, kov::bench::Tally& tally) {
-        value_.Reset();
-        rocksdb::Status s =
-            db_->Get(read_, db_->DefaultColumnFamily(), slice(key, keySize), &value_);
-        if (s.IsNotFound()) {
+        if (!get(slice(key, keySize))) {
             return false;
         }
-        check(s, "get");
         data_.assign(value_.data(), value_.data() + value_.size());
         tally.add(key, keySize, reinterpret_cast<const unsigned char*>(data_.data()));
         return true;
@@ -108,6 +133,16 @@ class RocksdbBackend {
     }
 
   private:
+    // Reads the key's value into value_; false when it is missing.
+    bool get(const rocksdb::Slice& key) {
+        value_.Reset();
+        rocksdb::Status s = db_->Get(read_, db_->DefaultColumnFamily(), key, &value_);
+        if (s.IsNotFound()) {
+            return false;
+        }
+        check(s, "get");
+        return true;
+    }
     static rocksdb::Slice slice(const unsigned char* bytes, std::size_t size) {
         return rocksdb::Slice(reinterpret_cast<const char*>(bytes), size);
     }

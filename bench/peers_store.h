@@ -1,6 +1,7 @@
 // The store as a host uses it: one table of the workload's kind and one
 // writing cursor on it for the whole run (the cursor is destroyed before the
-// table, as the store requires).
+// table, as the store requires). The counting workload keeps 8-byte counts
+// in a BlobTable (bench/store_ops.h).
 #ifndef KOVPAGER_BENCH_PEERS_STORE_H
 #define KOVPAGER_BENCH_PEERS_STORE_H
 
@@ -13,6 +14,7 @@
 #include <vector>
 
 #include "bench/bench_util.h"
+#include "bench/store_ops.h"
 
 namespace kov::peers {
 
@@ -31,6 +33,7 @@ class StoreBackend {
     void beginInt() { open(KovBtree::IntKeyTable); }
     void beginBlob() { open(KovBtree::BlobTable); }
     void beginKeys() { open(KovBtree::IndexTable); }
+    void beginCounts() { open(KovBtree::BlobTable); }
 
     void intInsert(std::int64_t key, const unsigned char* data, std::size_t size) {
         cursor_->insert(key, data, size);
@@ -40,17 +43,27 @@ class StoreBackend {
         cursor_->insert(key, keySize, data, dataSize);
     }
     void keyInsert(const unsigned char* key, std::size_t keySize) { cursor_->insert(key, keySize); }
+    void increment(const unsigned char* key, std::size_t keySize) {
+        kov::bench::storeIncrement(*cursor_, key, keySize);
+    }
 
-    // Every entry in key order, key and data copied out.
-    void scan(kov::bench::Tally& tally) {
+    bool readable(std::int64_t key) { return kov::bench::storeReadable(*cursor_, key); }
+    bool readable(const unsigned char* key, std::size_t keySize) {
+        return kov::bench::storeReadable(*cursor_, key, keySize);
+    }
+
+    // Every entry in key order, key and data copied out and handed to
+    // visit(key, keySize, data, dataSize).
+    template <class Visit>
+    void scan(Visit&& visit) {
         KovBtreeCursor& c = *cursor_;
         for (bool on = c.first(); on; on = c.next()) {
             c.indexKeyFetch("", 0, key_);  // the empty prefix: the whole key
             std::int64_t size = c.dataSize();
             data_.resize(static_cast<std::size_t>(size));
             c.data(data_.data(), static_cast<std::uint64_t>(size));
-            tally.add(reinterpret_cast<const unsigned char*>(key_.data()), key_.size(),
-                      data_.data());
+            visit(reinterpret_cast<const unsigned char*>(key_.data()), key_.size(), data_.data(),
+                  data_.size());
         }
     }
 

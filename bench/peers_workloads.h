@@ -7,6 +7,8 @@
 //   Shuffle order(n);          // W2: order.at(i) is a permutation of [0, n)
 //   CompositeKeys groups;      // W6 (bench_util.h): 1 000 group prefixes, a walk
 //                              // order and a generator of (group prefix, payload)
+//   SkewedDraws draws(n);      // W7 (bench_util.h): draws.at(i) is the key of draw i,
+//                              // a few keys drawn very often, most rarely
 //
 // Every backend sees the same keys in the same order, so the tallies of the
 // read workloads agree across backends (the driver prints them).
@@ -28,20 +30,15 @@ using kov::bench::kGolden;
 using kov::bench::mix;
 using kov::bench::putBigEndian;
 using kov::bench::Random;
+using kov::bench::SkewedDraws;  // W7
 
-// N random 16-byte keys with random access: key i is the generator's draws
-// 2i+1 and 2i+2, big-endian.
+// N random 16-byte keys with random access: key i is keyAt(kSeed, i).
 class RandomKeys {
   public:
     static constexpr std::uint64_t kSeed = kov::bench::kWorkloadKeySeed;
     explicit RandomKeys(std::uint64_t n) : n_(n) {}
     std::uint64_t size() const { return n_; }
-    Key16 at(std::uint64_t i) const {
-        Key16 k;
-        putBigEndian(k.data(), mix(kSeed + (2 * i + 1) * kGolden));
-        putBigEndian(k.data() + 8, mix(kSeed + (2 * i + 2) * kGolden));
-        return k;
-    }
+    Key16 at(std::uint64_t i) const { return kov::bench::keyAt(kSeed, i); }
 
   private:
     std::uint64_t n_;

@@ -8,16 +8,22 @@
 // lock, no syncing, and one exclusive transaction that is never committed:
 // the database lives and dies as scratch space, as the store's does.
 //
-// Three table kinds mirror the store's:
-//   RawIntTable   (k INTEGER PRIMARY KEY, v BLOB)
-//   RawBlobTable  (k BLOB PRIMARY KEY, v BLOB) WITHOUT ROWID
-//   RawKeyTable   (k BLOB PRIMARY KEY) WITHOUT ROWID
+// Three table kinds mirror the store's, and a fourth holds counts:
+//   RawIntTable    (k INTEGER PRIMARY KEY, v BLOB)
+//   RawBlobTable   (k BLOB PRIMARY KEY, v BLOB) WITHOUT ROWID
+//   RawKeyTable    (k BLOB PRIMARY KEY) WITHOUT ROWID
+//   RawCountTable  (key BLOB PRIMARY KEY, count INTEGER) WITHOUT ROWID
 // Each table prepares its statements once, at construction, and reuses them.
 // Inserts replace an entry with an equal key, the store's rule too: INSERT
 // OR REPLACE where there is data; on key-only tables INSERT OR IGNORE, which
-// comes to the same (an equal key is the same entry) and costs less. Byte keys are always bound as
-// blobs (a zero-length key as a zero-length blob, never NULL), so they compare bytewise unsigned,
-// shorter first.
+// comes to the same (an equal key is the same entry) and costs less. The
+// count table's one write is an upsert (INSERT ... ON CONFLICT DO UPDATE),
+// the way SQL counts in one statement what the store counts with a seek, a
+// read and an insert. Byte keys are always bound as blobs (a zero-length key
+// as a zero-length blob, never NULL), so they compare bytewise unsigned,
+// shorter first. Every table can say whether its entries read back
+// (readable: its first entry in key order and one key looked up), the check
+// each insert workload ends with.
 //
 // Every failure throws RawError with SQLite's message. Tables hold
 // statements of their database: destroy them before the database.
@@ -201,20 +207,57 @@ class RawDatabase {
     int tables_ = 0;
 };
 
-// What the tables with data share: the replacing insert of (k, v), whose
-// parameters the table binds, and the walk of every entry in key order.
-class RawDataTable {
+// What every table has: the walk of every entry in key order and the lookup
+// of one key, which together read the table back.
+class RawTable {
   public:
-    // Columns: 0 = key, 1 = data.
+    // The ordered walk: the key column first, then the table's others.
     RawScan& scan() { return scan_; }
 
+    // True when the first entry in key order is read and an entry with this
+    // key is found (an integer key on RawIntTable, bytes on the others).
+    bool readable(std::int64_t key) {
+        find_.bindInt(1, key);
+        return readBack();
+    }
+    bool readable(const void* key, std::size_t size) {
+        find_.bindBlob(1, key, size);
+        return readBack();
+    }
+
+  protected:
+    // `columns` names the key column first.
+    RawTable(RawDatabase& db, const std::string& name, const std::string& keyColumn,
+             const std::string& columns)
+        : scan_(db.handle(), "SELECT " + columns + " FROM " + name + " ORDER BY " + keyColumn),
+          find_(db.handle(), "SELECT 1 FROM " + name + " WHERE " + keyColumn + " = ?1") {}
+
+  private:
+    bool readBack() {
+        bool first = scan_.step();
+        if (first) {
+            scan_.reset();
+        }
+        bool found = find_.step();
+        if (found) {
+            find_.reset();
+        }
+        return first && found;
+    }
+
+    RawScan scan_;
+    RawStatement find_;
+};
+
+// What the tables with data share: the replacing insert of (k, v), whose
+// parameters the table binds. Scan columns: 0 = key, 1 = data.
+class RawDataTable : public RawTable {
   protected:
     RawDataTable(RawDatabase& db, const std::string& name)
-        : insert_(db.handle(), "INSERT OR REPLACE INTO " + name + "(k, v) VALUES(?1, ?2)"),
-          scan_(db.handle(), "SELECT k, v FROM " + name + " ORDER BY k") {}
+        : RawTable(db, name, "k", "k, v"),
+          insert_(db.handle(), "INSERT OR REPLACE INTO " + name + "(k, v) VALUES(?1, ?2)") {}
 
     RawStatement insert_;
-    RawStatement scan_;
 };
 
 // (k INTEGER PRIMARY KEY, v BLOB); its scan's key column is an integer.
@@ -268,7 +311,7 @@ class RawBlobTable : public RawDataTable {
 
 // (k BLOB PRIMARY KEY) WITHOUT ROWID: key-only entries with composite keys
 // (a group prefix followed by a payload).
-class RawKeyTable {
+class RawKeyTable : public RawTable {
   public:
     explicit RawKeyTable(RawDatabase& db)
         : RawKeyTable(db, db.createTable("(k BLOB PRIMARY KEY) WITHOUT ROWID")) {}
@@ -301,11 +344,48 @@ class RawKeyTable {
 
   private:
     RawKeyTable(RawDatabase& db, const std::string& name)
-        : insert_(db.handle(), "INSERT OR IGNORE INTO " + name + "(k) VALUES(?1)"),
+        : RawTable(db, name, "k", "k"),
+          insert_(db.handle(), "INSERT OR IGNORE INTO " + name + "(k) VALUES(?1)"),
           walk_(db.handle(), "SELECT k FROM " + name + " WHERE k >= ?1 ORDER BY k") {}
 
     RawStatement insert_;
     RawStatement walk_;
+};
+
+// (key BLOB PRIMARY KEY, count INTEGER) WITHOUT ROWID: how often each key was
+// counted. Scan columns: 0 = key, 1 = count (an integer).
+class RawCountTable : public RawTable {
+  public:
+    explicit RawCountTable(RawDatabase& db) : RawCountTable(db, db.createTable(kColumns)) {}
+
+    // Counts the key once more: 1 when it was absent.
+    void increment(const void* key, std::size_t keySize) {
+        upsert_.bindBlob(1, key, keySize);
+        upsert_.run();
+    }
+
+    // The whole table in key order: visit(key, keySize, count) for each row,
+    // the key copied out first.
+    template <class Visit>
+    void walk(std::vector<unsigned char>& keyBuf, Visit&& visit) {
+        for (RawScan& s = scan(); s.step();) {
+            std::size_t keySize = s.bytes(0);
+            keyBuf.resize(keySize);
+            std::memcpy(keyBuf.data(), s.blob(0), keySize);
+            visit(keyBuf.data(), keySize, static_cast<std::uint64_t>(s.integer(1)));
+        }
+    }
+
+  private:
+    static constexpr char kColumns[] = "(key BLOB PRIMARY KEY, count INTEGER) WITHOUT ROWID";
+
+    RawCountTable(RawDatabase& db, const std::string& name)
+        : RawTable(db, name, "key", "key, count"),
+          upsert_(db.handle(), "INSERT INTO " + name +
+                                   "(key, count) VALUES(?1, 1) "
+                                   "ON CONFLICT(key) DO UPDATE SET count = count + 1") {}
+
+    RawStatement upsert_;
 };
 
 // ---- The raw side of the paired workloads ----
@@ -336,6 +416,15 @@ inline auto rawKeyInserts(RawKeyTable& table, const std::vector<Key16>& keys) {
     return [&table, &keys](std::size_t begin, std::size_t end) {
         for (std::size_t i = begin; i < end; ++i) {
             table.insert(keys[i].data(), keys[i].size());
+        }
+    };
+}
+
+// Counts of keys[begin..end), each with one upsert.
+inline auto rawCountDraws(RawCountTable& table, const std::vector<Key16>& keys) {
+    return [&table, &keys](std::size_t begin, std::size_t end) {
+        for (std::size_t i = begin; i < end; ++i) {
+            table.increment(keys[i].data(), keys[i].size());
         }
     };
 }

@@ -4,16 +4,21 @@
 Every backend x workload x N runs in its own process of peers_benchmark (one
 JSON line each). The store and raw SQLite run `--reps` times, back to back and
 alternately (the order flips every repetition) so their ratio is measured on
-the same machine state; the other backends run `--peer-reps` times. The best
-(lowest) processor time of the repetitions is the figure reported.
+the same machine state; the other backends run `--peer-reps` times. The
+headline store / raw SQLite figure is the median of the ratios taken within
+each repetition; elsewhere the best (lowest) processor time of the
+repetitions is the figure reported.
 
     bench/run_peers.py --build build-peers                      # N = 100 000 and 1 000 000
+    bench/run_peers.py --build build-peers --n 100000,4000000   # any sizes, 4 M among them
     bench/run_peers.py --build build-peers --big-n 10000000 \\
         --big-backends store,sqlite --big-workloads W1,W3,W4      # plus a 10 M subset
     bench/run_peers.py --build build-peers --render-only        # tables and chart again
+    bench/run_peers.py --build build-peers --n 20000 --reps 1 --out /tmp/quick   # a quick look
 
 Raw results accumulate in <build>/peers-results.jsonl (one line per process;
---fresh starts it over). Only the standard library is used; the chart needs
+--fresh starts it over); with --out they go to <out>/peers-results.jsonl
+instead, so a quick run leaves the real results and bench/RESULTS.md alone. Only the standard library is used; the chart needs
 gnuplot (Debian gnuplot-nox) and is skipped with a message when it is missing.
 """
 
@@ -36,23 +41,32 @@ WORKLOADS = {
     "W5": "random point seeks of existing W3 keys, data read (ns/seek)",
     "W6": "prefix walk of 1 000 groups of composite keys (ns/entry walked)",
     "W6i": "key-only inserts of the W6 composite keys, random order (ns/insert; the fill phase of W6)",
+    "W7": "read-modify-write counts of skewed keys, then a walk (ns/draw; N draws of 16-byte keys, "
+          "each a lookup of the key's 8-byte count and a write of count + 1)",
 }
-ORDER = ["W1", "W2", "W3", "W4", "W5", "W6", "W6i"]
+ORDER = ["W1", "W2", "W3", "W4", "W5", "W6", "W6i", "W7"]
 BACKEND_ORDER = ["store", "sqlite", "map", "lmdb", "rocksdb"]
+# Per-operation fields of a phase, recorded for the fill phase too (fill_<field>).
+SPLIT_FIELDS = ["ns_user", "ns_sys", "reads_per_op", "writes_per_op", "read_bytes_per_op",
+                "write_bytes_per_op"]
 SETTINGS = {
     "store": "KovBtree / KovBtreeCursor on the library's own SQLite B-trees; one writing cursor "
-             "per table; temporary file in KOV_TEMP",
+             "per table; temporary file in KOV_TEMP; W7: seek, data() of the 8-byte count when "
+             "found, insert of count + 1 on a BlobTable",
     "sqlite": "hand-written SQL through the system's SQLite (Debian's libsqlite3): temporary "
               "database (empty name), page_size 4096, cache_size 16384 "
               "(64 MiB), journal_mode OFF, locking_mode EXCLUSIVE, synchronous OFF, one BEGIN "
               "EXCLUSIVE never committed, prepared statements, INSERT OR REPLACE (INSERT OR IGNORE "
-              "on the key-only table)",
-    "map": "std::map / std::set in the heap, 100-byte std::array data: the in-memory ceiling",
+              "on the key-only table); W7 counts with one prepared `INSERT INTO t(key, count) "
+              "VALUES(?1, 1) ON CONFLICT(key) DO UPDATE SET count = count + 1` per draw on "
+              "(key BLOB PRIMARY KEY, count INTEGER) WITHOUT ROWID",
+    "map": "std::map / std::set in the heap, 100-byte std::array data: the in-memory ceiling; "
+           "W7: find, then operator[] on a std::map of 8-byte counts",
     "lmdb": "64 GiB map (sparse), MDB_NOSYNC | MDB_WRITEMAP | MDB_NOMETASYNC, one write "
             "transaction for the run (aborted at the end), MDB_INTEGERKEY for integer keys; "
-            "cache = the kernel's page cache",
+            "cache = the kernel's page cache; W7: mdb_get, then mdb_put",
     "rocksdb": "64 MiB LRU block cache, default write buffer (64 MiB) and background jobs, WAL "
-               "disabled, no sync; integer keys as 8 big-endian bytes",
+               "disabled, no sync; integer keys as 8 big-endian bytes; W7: Get, then Put",
 }
 
 
@@ -140,6 +154,8 @@ def load(path):
             e["ns_cpu"] = r["fill_ns_cpu"]
             e["ns_wall"] = r["fill_ns_wall"]
             e["ops"] = r["n"]
+            for field in SPLIT_FIELDS:
+                e[field] = r.get("fill_" + field)  # None from runs that did not record it
             extra.append(e)
     return rows + extra
 
@@ -182,6 +198,18 @@ def per_backend_table(rows, ns, backends, cell):
     return md_table(["backend"] + [f"N={fmt_n(n)}" for n in ns], ["---"] + ["---:"] * len(ns),
                     [[b] + [cell([r for r in rows if r["backend"] == b and r["n"] == n]) or "-"
                             for n in ns] for b in backends])
+
+
+def tally_mismatches(rows, ns):
+    """The workloads and sizes whose read tallies differ across backends (W7: or whose counts do
+    not add up to N)."""
+    bad = []
+    for w in ("W4", "W5", "W6", "W7"):
+        for n in ns:
+            tallies = {(r["rows"], r["sum"]) for r in rows if r["workload"] == w and r["n"] == n}
+            if len(tallies) > 1 or (w == "W7" and any(s != n for _, s in tallies)):
+                bad.append(f"{w} N={fmt_n(n)}")
+    return bad
 
 
 def machine():
@@ -262,6 +290,16 @@ def render(args, rows, results_md, chart_png, command):
              "operation over all the passes. Keys are computed on the fly, so no process holds "
              "a copy of the workload; the key computation (a few ns) is inside every timing, "
              "for every backend alike.")
+    L.append("- Every insert phase (W1, W2, W3, the fills of W4, W5 and W6, W7's draws) ends "
+             "inside its timing with the entries read back: the first entry in key order and a "
+             "lookup of the last key inserted, which must be found. A backend that defers work "
+             "until the next read pays for it in the workload that caused it.")
+    L.append("- W7 draws key ranks r = floor((N+1)^u) - 1, u uniform in [0, 1): P(r) = "
+             "ln((r+2)/(r+1)) / ln(N+1), Zipf's law with exponent 1 over N distinct keys (the "
+             "hottest takes about 5 % of the draws). About a fifth to a quarter of the keys "
+             "come up (25 k at N = 100 k, 223 k at 1 M, 836 k at 4 M, 2.0 M at 10 M). The "
+             "final walk reads every count in key order and is inside the timing; its tally "
+             "(rows, sum of counts = N) must agree across backends.")
     L.append("")
     L.append("## Backends and their memory settings")
     L.append("")
@@ -272,9 +310,10 @@ def render(args, rows, results_md, chart_png, command):
     # Headline: store vs raw SQLite.
     L.append("## Headline: the store / raw SQLite")
     L.append("")
-    L.append("Best-of ratio = best store time / best raw time (processor time). Paired = the "
-             "median of the ratios of the runs made back to back. Wall = the same best-of ratio "
-             "on elapsed time.")
+    L.append("Paired = the median over the repetitions of store time / raw time (processor "
+             "time), each ratio taken within one repetition, where the two ran back to back "
+             "(their order flipping every repetition): the figure to quote. Best-of = best "
+             "store time / best raw time, beside it. Wall = the paired median on elapsed time.")
     L.append("")
     headline = []
     for w in workloads:
@@ -291,13 +330,13 @@ def render(args, rows, results_md, chart_png, command):
             pairs = {}
             for r in s + q:
                 pairs.setdefault((r.get("invocation", ""), r.get("rep", 0)), {})[r["backend"]] = r
-            paired = [p["store"]["ns_cpu"] / p["sqlite"]["ns_cpu"] for p in pairs.values()
-                      if "store" in p and "sqlite" in p]
-            wall = min(r["ns_wall"] for r in s) / min(r["ns_wall"] for r in q)
-            cells += [f"{ratio:.2f}", f"{statistics.median(paired):.2f}" if paired else "-",
-                      f"{wall:.2f}"]
+            pairs = [p for p in pairs.values() if "store" in p and "sqlite" in p]
+            paired = [p["store"]["ns_cpu"] / p["sqlite"]["ns_cpu"] for p in pairs]
+            wall = [p["store"]["ns_wall"] / p["sqlite"]["ns_wall"] for p in pairs]
+            cells += [f"**{statistics.median(paired):.2f}**" if paired else "-", f"{ratio:.2f}",
+                      f"{statistics.median(wall):.2f}" if wall else "-"]
         headline.append([w] + cells)
-    L += md_table(["workload"] + [f"N={fmt_n(n)} best-of | paired | wall" for n in ns],
+    L += md_table(["workload"] + [f"N={fmt_n(n)} paired | best-of | wall" for n in ns],
                   ["---"] + ["---:"] * (3 * len(ns)), headline)
     L.append("")
 
@@ -323,50 +362,60 @@ def render(args, rows, results_md, chart_png, command):
         else "-")
     L.append("")
 
-    # The store against LMDB, the fastest peer.
-    if any(b == "lmdb" for b in backends):
-        L.append("## The store against LMDB (processor time, best of repetitions)")
+    # The store against LMDB and RocksDB.
+    peers = [b for b in ("lmdb", "rocksdb") if b in backends]
+    if peers:
+        names = {"lmdb": "LMDB", "rocksdb": "RocksDB"}
+        L.append("## The store against " + " and ".join(names[b] for b in peers) +
+                 " (processor time, best of repetitions)")
         L.append("")
-        L.append("Store time / LMDB time: at or below 1 the store is as fast as LMDB or faster.")
+        L.append("Store time / peer time: at or below 1 the store is as fast as the peer or "
+                 "faster.")
         L.append("")
-        lmdb_ns = [n for n in ns if any((w, n, "lmdb") in best for w in workloads)]
+        peer_ns = [n for n in ns if any((w, n, b) in best for w in workloads for b in peers)]
         cells = []
         for w in workloads:
             cells.append([w])
-            for n in lmdb_ns:
-                s_, l_ = best.get((w, n, "store")), best.get((w, n, "lmdb"))
-                cells[-1].append(f"{s_['ns_cpu'] / l_['ns_cpu']:.2f}" if s_ and l_ else "-")
-        L += md_table(["workload"] + [f"N={fmt_n(n)}" for n in lmdb_ns],
-                      ["---"] + ["---:"] * len(lmdb_ns), cells)
+            for n in peer_ns:
+                for b in peers:
+                    s_, p_ = best.get((w, n, "store")), best.get((w, n, b))
+                    cells[-1].append(f"{s_['ns_cpu'] / p_['ns_cpu']:.2f}" if s_ and p_ else "-")
+        L += md_table(["workload"] + [f"N={fmt_n(n)} {names[b]}" for n in peer_ns for b in peers],
+                      ["---"] + ["---:"] * (len(peer_ns) * len(peers)), cells)
         L.append("")
 
     # Where the processor time goes, and the temporary file's system calls.
-    split = [r for r in rows if "ns_sys" in r and r["backend"] in ("store", "sqlite")]
+    split = [r for r in rows if r.get("ns_sys") is not None]
     if split:
-        L.append("## Where the time goes: the store and raw SQLite")
+        L.append("## Where the time goes, per workload and backend")
         L.append("")
         L.append("Per operation of the measured phase, from the run with the best processor "
                  "time: user and kernel processor ns (getrusage), and the read and write system "
-                 "calls on the temporary file with the KiB they moved (/proc/self/io). Below "
-                 "the cache nothing goes to the file.")
+                 "calls with the KiB they moved (/proc/self/io): for the store and raw SQLite "
+                 "those on the temporary file (below the cache nothing goes to it), for RocksDB "
+                 "those of its files and background threads; LMDB writes through its memory "
+                 "map, which no system call counts. Peak RSS: that run's peak resident set "
+                 "(MiB, getrusage ru_maxrss, the whole process: for W4, W5 and W6 the fill "
+                 "included).")
         L.append("")
         cells = []
         for w in workloads:
             for n in ns:
-                for b in ("store", "sqlite"):
+                for b in backends:
                     cands = [r for r in split if r["workload"] == w and r["n"] == n and
                              r["backend"] == b]
-                    if not cands or w == "W6i":
+                    if not cands:
                         continue
                     r = min(cands, key=lambda r: r["ns_cpu"])
                     cells.append([w, fmt_n(n), b, fmt_ns(r["ns_user"]), fmt_ns(r["ns_sys"]),
                                   f"{r['reads_per_op']:.2f}",
                                   f"{r['read_bytes_per_op'] / 1024:.1f}",
                                   f"{r['writes_per_op']:.2f}",
-                                  f"{r['write_bytes_per_op'] / 1024:.1f}"])
+                                  f"{r['write_bytes_per_op'] / 1024:.1f}",
+                                  f"{r['peak_rss_kib'] / 1024:.0f}"])
         L += md_table(["workload", "N", "backend", "user ns", "kernel ns", "reads", "KiB read",
-                       "writes", "KiB written"],
-                      ["---", "---:", "---", "---:", "---:", "---:", "---:", "---:", "---:"], cells)
+                       "writes", "KiB written", "peak RSS"],
+                      ["---", "---:", "---"] + ["---:"] * 7, cells)
         L.append("")
 
     # Memory and disk.
@@ -392,12 +441,7 @@ def render(args, rows, results_md, chart_png, command):
     L.append("")
 
     # Cross-check of the read tallies.
-    bad = []
-    for w in ("W4", "W5", "W6"):
-        for n in ns:
-            tallies = {(r["rows"], r["sum"]) for r in rows if r["workload"] == w and r["n"] == n}
-            if len(tallies) > 1:
-                bad.append(f"{w} N={fmt_n(n)}")
+    bad = tally_mismatches(rows, ns)
     missing = [r for r in rows if r.get("missing", 0)]
     L.append("## Checks")
     L.append("")
@@ -406,7 +450,8 @@ def render(args, rows, results_md, chart_png, command):
                  f"{len(missing)} runs had seeks that found nothing.")
     else:
         L.append("- Every backend read the same rows with the same checksum in W4, W5 and W6, "
-                 "and every seek found its key.")
+                 "counted the same keys with counts adding up to N in W7, and every seek found "
+                 "its key.")
     L.append("")
     if len({r.get("tree", "?") for r in rows}) > 1:
         L.append("## Notes: which source tree each figure comes from")
@@ -465,7 +510,8 @@ def chart(best, ns, backends, workloads, chart_png, args):
             plots.append(f"'{path}' using 1:2 with linespoints title '{b}' "
                          f"{styles.get(b, '')}")
         if plots:
-            script.append(f"set title '{w}: {WORKLOADS[w].split(' (')[0]}' font ',9'")
+            title = f"{w}: {WORKLOADS[w].split(' (')[0]}".replace("'", "''")  # gnuplot quoting
+            script.append(f"set title '{title}' font ',9'")
             script.append("plot " + ", ".join(plots))
     script.append("unset multiplot")
     path = os.path.join(datadir, "peers.gp")
@@ -482,7 +528,7 @@ def main():
                    help="build directory holding bench/peers_benchmark")
     p.add_argument("--n", default="100000,1000000", help="workload sizes, comma separated")
     p.add_argument("--backends", default=",".join(BACKEND_ORDER))
-    p.add_argument("--workloads", default="W1,W2,W3,W4,W5,W6")
+    p.add_argument("--workloads", default="W1,W2,W3,W4,W5,W6,W7")
     p.add_argument("--big-n", default="", help="extra sizes run only on --big-backends")
     p.add_argument("--big-backends", default="store,sqlite")
     p.add_argument("--big-workloads", default="W1,W3,W4")
@@ -491,12 +537,18 @@ def main():
     p.add_argument("--scratch", default="", help="scratch root (default: beside the program)")
     p.add_argument("--fresh", action="store_true", help="start the results file over")
     p.add_argument("--render-only", action="store_true", help="only rewrite the report")
-    p.add_argument("--results", default="", help="results file (default: <build>/peers-results.jsonl)")
-    p.add_argument("--out", default=here, help="where RESULTS.md and peers.png go")
+    p.add_argument("--results", default="",
+                   help="results file (default: <out>/peers-results.jsonl with --out, otherwise "
+                        "<build>/peers-results.jsonl)")
+    p.add_argument("--out", default="",
+                   help="where RESULTS.md and peers.png go (default: bench/, the published ones)")
     args = p.parse_args()
     args.build = os.path.abspath(args.build)
     program = os.path.join(args.build, "bench", "peers_benchmark")
-    results = args.results or os.path.join(args.build, "peers-results.jsonl")
+    if args.out:
+        os.makedirs(args.out, exist_ok=True)
+    results = args.results or os.path.join(args.out or args.build, "peers-results.jsonl")
+    args.out = args.out or here
     command = shlex.join(["bench/run_peers.py"] + sys.argv[1:])
     if not args.render_only:
         if not os.access(program, os.X_OK):

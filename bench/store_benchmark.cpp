@@ -10,10 +10,13 @@
 //   BM_RandomBlobInsert  N inserts of random 16-byte keys with 100-byte data
 //   BM_OrderedScan       a full ordered walk of the N random-key entries, key and data read
 //   BM_RandomSeek        N/10 seeks of existing random keys, data read
+//   BM_CountDraws        N draws of 16-byte keys from a skewed law, each key's count read
+//                        and written back plus one (raw: one upsert), then the counts walked
 //   BM_CompositeInsert   N key-only inserts, random order, of 16-byte composite keys: an
 //                        8-byte prefix naming one of 1 000 groups, then an 8-byte payload
 //   BM_PrefixWalk        every group walked by its prefix, payload read (ns per entry)
-// Inserts start from an empty table every iteration. Counters: store_ns and
+// Inserts start from an empty table every iteration and end, inside the timing, with the
+// entries read back (the first entry and the last key inserted). Counters: store_ns and
 // raw_ns, processor nanoseconds per operation; ratio = store / raw on
 // processor time, wall_ratio the same on elapsed time. The Time column is
 // the store's elapsed time per iteration.
@@ -39,6 +42,7 @@
 #include "bench/bench_util.h"
 #include "bench/paired_workloads.h"
 #include "bench/raw_sqlite.h"
+#include "bench/store_ops.h"
 
 namespace {
 
@@ -48,6 +52,7 @@ using kov::bench::Key16;
 using kov::bench::PairedRun;
 using kov::bench::Payload;
 using kov::bench::RawBlobTable;
+using kov::bench::RawCountTable;
 using kov::bench::RawDatabase;
 using kov::bench::RawIntTable;
 using kov::bench::RawKeyTable;
@@ -71,7 +76,8 @@ using KeyPair = TablePair<RawKeyTable>;
 class StoreCursor {
   public:
     explicit StoreCursor(KovBtree& table) : c_(table, true) {}
-    explicit StoreCursor(BlobPair& set) : StoreCursor(set.table) {}
+    template <class RawTable>
+    explicit StoreCursor(TablePair<RawTable>& set) : StoreCursor(set.table) {}
 
     KovBtreeCursor& get() { return c_; }
 
@@ -81,6 +87,12 @@ class StoreCursor {
     void insert(const unsigned char* key, std::size_t keySize, const unsigned char* data,
                 std::size_t size) {
         c_.insert(key, keySize, data, size);
+    }
+    void increment(const Key16& key) { kov::bench::storeIncrement(c_, key.data(), key.size()); }
+
+    bool readable(std::int64_t key) { return kov::bench::storeReadable(c_, key); }
+    bool readable(const unsigned char* key, std::size_t keySize) {
+        return kov::bench::storeReadable(c_, key, keySize);
     }
 
     bool step(bool started) { return started ? c_.next() : c_.first(); }
@@ -94,6 +106,13 @@ class StoreCursor {
         }
         c_.data(dataBuf.data(), dataSize);
         tally.add(reinterpret_cast<const unsigned char*>(key_.data()), key_.size(), dataBuf.data());
+    }
+
+    void readCount(std::vector<unsigned char>& /*keyBuf: the key goes to a string*/, Tally& tally) {
+        c_.indexKeyFetch("", 0, key_);
+        std::uint64_t count = 0;
+        c_.data(&count, sizeof count);
+        tally.addCount(count);
     }
 
     void seekEntry(const Key16& key, std::vector<unsigned char>& buffer, Tally& tally) {
@@ -128,10 +147,7 @@ const CompositeSet& compositeKeys(std::size_t n) {
         for (Key16& k : c.keys) {
             k = c.groups.next();
         }
-        std::vector<Key16> sorted = c.keys;
-        std::sort(sorted.begin(), sorted.end());
-        c.distinct =
-            static_cast<std::size_t>(std::unique(sorted.begin(), sorted.end()) - sorted.begin());
+        c.distinct = kov::bench::distinctKeys(c.keys);
     }
     return c;
 }
@@ -148,6 +164,11 @@ struct StoreSide {
 
     using BlobSet = BlobPair;
     using Cursor = StoreCursor;
+
+    // A raw count table and a store BlobTable of 8-byte counts.
+    struct CountSet : TablePair<RawCountTable> {
+        CountSet() : TablePair(KovBtree::BlobTable) {}
+    };
 
     // A raw integer-keyed table and a store one.
     struct IntSet : TablePair<RawIntTable> {
@@ -220,13 +241,27 @@ void BM_CompositeInsert(benchmark::State& state) {
             auto set = std::make_unique<KeyPair>(KovBtree::IndexTable);
             {
                 KovBtreeCursor cursor(set->table, true);
-                run.sides(n, kov::bench::kInsertChunk,
-                          kov::bench::rawKeyInserts(set->rawTable, keys),
-                          [&](std::size_t begin, std::size_t end) {
-                              for (std::size_t i = begin; i < end; ++i) {
-                                  cursor.insert(keys[i].data(), keys[i].size());
-                              }
-                          });
+                const Key16& last = keys[n - 1];
+                run.sides(
+                    n, kov::bench::kInsertChunk,
+                    kov::bench::endingWith(n, kov::bench::rawKeyInserts(set->rawTable, keys),
+                                           [&] {
+                                               kov::bench::requireReadable(
+                                                   set->rawTable.readable(last.data(), last.size()),
+                                                   kov::bench::kRawName);
+                                           }),
+                    kov::bench::endingWith(
+                        n,
+                        [&](std::size_t begin, std::size_t end) {
+                            for (std::size_t i = begin; i < end; ++i) {
+                                cursor.insert(keys[i].data(), keys[i].size());
+                            }
+                        },
+                        [&] {
+                            kov::bench::requireReadable(
+                                kov::bench::storeReadable(cursor, last.data(), last.size()),
+                                StoreSide::kName);
+                        }));
             }
             gCompositeSet = std::move(set);
         }
