@@ -18,4 +18,6 @@ target_compile_definitions(${KOV_TEST} PRIVATE
   KOV_LIBRARY_SONAME="$<TARGET_SONAME_FILE_NAME:kovpager>")
 add_dependencies(${KOV_TEST} module_host module_plugin kovpager)
 
-kov_discover_tests(${KOV_TEST} TIMEOUT 300)
+kov_discover_tests(${KOV_TEST} TIMEOUT 300
+  LARGE ModuleLibrary.UnloadAfterUsePastTheCacheClosesTheEngineAndLeavesNothing
+        ModuleExit.ProcessThatExitsAfterUseLeavesItsTemporaryDirectoryEmpty)
