@@ -46,7 +46,7 @@ void resetPageCacheCounters();
 
 // The share of a purgeable cache's budget, in percent, that unpinned
 // interior pages may hold before the least recently used of them is
-// recycled ahead of leaves (75 unless changed; 100 = no limit). For
+// recycled ahead of leaves: 100 (no limit) unless changed. For
 // measurements and tests; returns the previous value.
 int TEST_setInteriorSharePercent(int percent);
 

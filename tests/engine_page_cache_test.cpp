@@ -215,7 +215,8 @@ TEST(PageCache, PageOneIsClassifiedByTheByteAfterTheFileHeader) {
     EXPECT_TRUE(c.holds(1));
 }
 
-TEST(PageCache, InteriorPagesHoldAtMostThreeQuartersOfTheBudget) {
+TEST(PageCache, WithAShareSetInteriorPagesHoldAtMostThatShare) {
+    const int previous = TEST_setInteriorSharePercent(75);
     Cache c(true, 100);
     ASSERT_TRUE(c.ok());
     for (unsigned k = 1; k <= 95; ++k)
@@ -234,10 +235,10 @@ TEST(PageCache, InteriorPagesHoldAtMostThreeQuartersOfTheBudget) {
     EXPECT_EQ(interior, 75);
     EXPECT_FALSE(c.holds(20));  // the least recently used ones went
     EXPECT_TRUE(c.holds(95));
+    TEST_setInteriorSharePercent(previous);
 }
 
-TEST(PageCache, WithTheShareUnlimitedInteriorPagesFillTheBudget) {
-    const int previous = TEST_setInteriorSharePercent(100);
+TEST(PageCache, InteriorPagesMayFillTheBudgetLeavingOneLeafPage) {
     {
         Cache c(true, 50);
         ASSERT_TRUE(c.ok());
@@ -250,7 +251,6 @@ TEST(PageCache, WithTheShareUnlimitedInteriorPagesFillTheBudget) {
             interior += c.holds(k) ? 1 : 0;
         EXPECT_EQ(interior, 49);
     }
-    TEST_setInteriorSharePercent(previous);
 }
 
 TEST(PageCache, CreateFlagOneRefusesWhenOnlyInteriorPagesCouldBeRecycled) {
