@@ -33,6 +33,10 @@ constexpr unsigned char kLeafIndex = 0x0a;
 class Cache {
   public:
     Cache(bool purgeable, int budget) : m_(pageCacheMethods()) {
+        // The cache allocates through SQLite, which initialises on its first
+        // allocation and takes no page cache after that: installed first, so
+        // that the engine test in the same program finds it in place.
+        installPageCache();
         cache_ = m_.xCreate(kPageSize, kExtraSize, purgeable ? 1 : 0);
         if (cache_ != nullptr)
             m_.xCachesize(cache_, budget);
