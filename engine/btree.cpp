@@ -52,6 +52,7 @@
 
 // After engine/btree.h: its result codes share SQLite's macro names.
 #include "engine/private_sqlite3.h"
+#include "engine/page_cache.h"
 #include "engine/sorted_load.h"
 #include "engine/sqlite_btree.h"
 
@@ -458,6 +459,7 @@ int sqlite3BtreeOpen(const char* filename, sqlite3* db, Btree** ppBtree, int fla
         return SQLITE_MISUSE;
 
     auto bt = std::make_unique<Btree>();
+    installPageCache();  // before SQLite initialises: engine/page_cache.h
     int rc = sqlite3_open_v2("", &bt->db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
     if (rc == SQLITE_OK && (flags & BTREE_OMIT_JOURNAL) != 0)
         rc = exec(bt->db, "PRAGMA journal_mode=OFF");
