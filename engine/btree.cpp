@@ -35,6 +35,9 @@
 //     onEntry false; it is freed only by sqlite3BtreeCloseCursor.
 //  5. Btree::writable is false from the first failure SQLite reports until
 //     the engine is closed; every write checks it first.
+//  6. A table with inserts gathered and not merged (Table::pending) has no
+//     cursor on an entry and no read cursor: every read merges them first.
+//  7. Btree::gathered is the sum of the bytes of every table's load buffer.
 //
 // Debug builds check these with assert (checkEngine, checkCursor) at every
 // operation that could break them; release builds compile the checks away.
@@ -140,6 +143,7 @@ void checkCursor(const BtCursor* cur) {
 void checkEngine(const Btree* bt) {
 #ifndef NDEBUG
     int open = 0;
+    std::size_t gathered = 0;
     for (const auto& entry : bt->tables) {
         const Table* t = entry.second.get();
         assert(t->root == entry.first);
@@ -148,12 +152,16 @@ void checkEngine(const Btree* bt) {
             assert(c->bt == bt && c->table == t);
             assert(c->next == nullptr || c->next->prev == c);
             checkCursor(c);
+            assert(t->pending == nullptr || !c->onEntry);  // invariant 6
             readers += c->write ? 0 : 1;
             ++open;
         }
         assert(readers == t->readCursors);
+        assert(t->pending == nullptr || t->readCursors == 0);  // invariant 6
+        gathered += t->pending != nullptr ? t->pending->buffer.bytes() : 0;
     }
     assert(open == bt->openCursors);
+    assert(gathered == bt->gathered);  // invariant 7
     assert(bt->writable || bt->failureCode != SQLITE_OK);
 #else
     (void)bt;
@@ -364,12 +372,15 @@ int spillLargest(Btree* bt) {
     if (largest == nullptr || largest->pending->buffer.empty())
         return SQLITE_OK;
     PendingLoad& load = *largest->pending;
+    // A load that arrives in key order, with no run before it, goes into the table now by
+    // appending when its keys all lie above the table's: it is written once, not twice. (A load
+    // in random order goes into runs even when the table is empty, so that the merge can append
+    // all of it: the table's pages are then filled, not split.)
+    const bool arrivedInOrder = load.buffer.sorted();
     load.buffer.sortUnique();
-    // With no run before it, a buffer whose keys all lie above the table's goes into the table
-    // now, by appending, instead of into a run (a load in key order is written once).
     bool appends = false;
     int rc = SQLITE_OK;
-    if (load.runs.empty())
+    if (load.runs.empty() && arrivedInOrder)
         rc = appendsToTable(bt->tree, largest->root, largest->shape(), load.buffer, &appends);
     if (rc == SQLITE_OK && appends) {
         rc = mergeInto(bt->tree, largest->root, largest->shape(), load.runs, load.buffer, &appends);

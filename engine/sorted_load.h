@@ -67,6 +67,8 @@ class LoadBuffer {
     // Sorts in key order and drops every entry that a later insert of an equal key replaces.
     void sortUnique();
 
+    // True when the entries are in key order and unique: as they arrived, or after sortUnique().
+    bool sorted() const { return inOrder_; }
     std::size_t size() const { return slots_.size(); }
     bool empty() const { return slots_.empty(); }
     // The sum of the footprints of the entries held.
