@@ -134,16 +134,18 @@ struct ProgramOptions {
 // The options of a store fuzz target's input (tests/fuzz/store_fuzz.cpp) from its first byte:
 // bit 0 set = tables are destroyed only after their cursors (the order the store asks for);
 // bit 1 set = some records are a few KB long; bit 2 set = pager copies; bit 3 set = a load
-// buffer of about 1 KiB, gathered from the second insert after a read (runs and merges within a
-// few dozen inserts).
+// buffer of about 1 KiB, gathered from the second insert after a read, and three cursor actions
+// in four inserts (runs and merges within a few dozen inserts).
 inline ProgramOptions fuzzVariant(std::uint8_t variant) {
     ProgramOptions options;
     options.oddInputs = true;
     options.cursorsBeforeTables = (variant & 1) != 0;
     options.bigPercent = (variant & 2) != 0 ? 5 : 0;
     options.pagerCopies = (variant & 4) != 0;
-    if ((variant & 8) != 0)
+    if ((variant & 8) != 0) {
         options.loads = kov::engine::test::kTinyLoads;
+        options.insertPercent = 75;
+    }
     return options;
 }
 
