@@ -1283,6 +1283,7 @@ class StoreProgram::Impl {
             return false;
         };
         std::uint64_t lostMerged = 0;
+        std::uint64_t lostGathered = 0;
         std::uint64_t extra = 0;
         for (const auto& e : merged) {
             const std::string key = keyText(e.first);
@@ -1291,11 +1292,13 @@ class StoreProgram::Impl {
             auto it = truth.find(e.first);
             bool ok = it != truth.end() && it->second == e.second;
             if (!ok && partial != nullptr) {
-                // Merged half-way: the key may still hold what it held before the merge.
+                // Merged half-way: the key may still hold what it held before the merge, and
+                // then lost an entry that was still gathered.
                 auto change = partial->find(key);
                 if (change != partial->end()) {
                     const MergeChange& c = change->second;
                     ok = c.hadOld ? it != truth.end() && it->second == c.old : it == truth.end();
+                    lostGathered += ok ? 1 : 0;
                 }
             }
             lostMerged += ok ? 0 : 1;
@@ -1306,7 +1309,6 @@ class StoreProgram::Impl {
                 continue;
             ++extra;  // neither merged nor held before a merge (those are in `merged` too)
         }
-        std::uint64_t lostGathered = 0;
         for (const auto& e : current) {
             if (skip(keyText(e.first)))
                 continue;
