@@ -118,18 +118,7 @@ TEST(PagerModel, TinyLoadsRunAndMergeAsTheModelSays) {
             ADD_FAILURE() << "first failing seed: " << seed;
             return;
         }
-        sum.engine.gathered += r.engine.gathered;
-        sum.engine.runsWritten += r.engine.runsWritten;
-        sum.engine.merges += r.engine.merges;
-        sum.engine.mergedByAppend += r.engine.mergedByAppend;
-        sum.statsChecked += r.statsChecked;
-        sum.readsBetweenInserts += r.readsBetweenInserts;
-        sum.mergesByInserts += r.mergesByInserts;
-        sum.mergesOverEqualKeys += r.mergesOverEqualKeys;
-        sum.createdWithPending += r.createdWithPending;
-        sum.resetsWithPending += r.resetsWithPending;
-        sum.destroyedWithPending += r.destroyedWithPending;
-        sum.ambiguousSpills += r.ambiguousSpills;
+        kovtest::addLoads(sum, r);
     }
     std::printf("%d programs: gathered %llu, runs %llu, merges %llu (by appending %llu, by inserts "
                 "%llu, over equal keys %llu), reads between inserts %llu, created / reset / "

@@ -84,7 +84,7 @@ class StoreProgram::Impl {
     const LoadReport& loadReport() {
         loadReport_.engine = loadTotals_;
         if (engineOpen_ && KovTestAccess::engine() != nullptr)
-            addStats(loadReport_.engine, kov::engine::TEST_loadStats(KovTestAccess::engine()));
+            addLoads(loadReport_.engine, kov::engine::TEST_loadStats(KovTestAccess::engine()));
         return loadReport_;
     }
     bool stopped() const { return stopped_; }
@@ -1033,17 +1033,10 @@ class StoreProgram::Impl {
 
     // ---- loads -------------------------------------------------------------------------------
 
-    static void addStats(kov::engine::LoadStats& sum, const kov::engine::LoadStats& s) {
-        sum.gathered += s.gathered;
-        sum.runsWritten += s.runsWritten;
-        sum.merges += s.merges;
-        sum.mergedByAppend += s.mergedByAppend;
-        sum.insertsAfterSearch += s.insertsAfterSearch;
-    }
     // The statistics of the engine about to close go into the run's sum.
     void harvestLoadStats() {
         if (engineOpen_ && KovTestAccess::engine() != nullptr)
-            addStats(loadTotals_, kov::engine::TEST_loadStats(KovTestAccess::engine()));
+            addLoads(loadTotals_, kov::engine::TEST_loadStats(KovTestAccess::engine()));
     }
     static std::string intKeyText(std::int64_t k) {
         std::string text(8, '\0');

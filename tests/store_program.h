@@ -196,6 +196,25 @@ struct LoadReport {
     std::uint64_t ambiguousSpills = 0;
 };
 
+inline void addLoads(kov::engine::LoadStats& sum, const kov::engine::LoadStats& s) {
+    sum.gathered += s.gathered;
+    sum.runsWritten += s.runsWritten;
+    sum.merges += s.merges;
+    sum.mergedByAppend += s.mergedByAppend;
+    sum.insertsAfterSearch += s.insertsAfterSearch;
+}
+inline void addLoads(LoadReport& sum, const LoadReport& r) {
+    addLoads(sum.engine, r.engine);
+    sum.statsChecked += r.statsChecked;
+    sum.readsBetweenInserts += r.readsBetweenInserts;
+    sum.mergesByInserts += r.mergesByInserts;
+    sum.mergesOverEqualKeys += r.mergesOverEqualKeys;
+    sum.createdWithPending += r.createdWithPending;
+    sum.resetsWithPending += r.resetsWithPending;
+    sum.destroyedWithPending += r.destroyedWithPending;
+    sum.ambiguousSpills += r.ambiguousSpills;
+}
+
 class StoreProgram {
   public:
     StoreProgram(ChoiceSource& choices, ProgramOptions options);

@@ -47,10 +47,7 @@ struct Totals {
     std::uint64_t runsWritesRefused = 0;
     // Loads (store_program.h, LoadReport), over the runs with tiny loads and over all.
     std::uint64_t runsTinyLoads = 0;
-    kov::engine::LoadStats loads;
-    std::uint64_t mergesByInserts = 0;
-    std::uint64_t mergesOverEqualKeys = 0;
-    std::uint64_t createdResetDestroyedWithPending = 0;
+    kovtest::LoadReport loads;
     std::uint64_t entriesLostGathered = 0;
     std::uint64_t entriesLostMerged = 0;
     std::uint64_t tablesAsMerged = 0;
@@ -126,13 +123,14 @@ void print(const char* what, const Totals& t, double seconds) {
         "tables as merged %llu, not as merged %llu, uncertain %llu; gathered entries lost %llu, "
         "merged entries lost %llu\n",
         static_cast<unsigned long long>(t.runsTinyLoads),
-        static_cast<unsigned long long>(t.loads.gathered),
-        static_cast<unsigned long long>(t.loads.runsWritten),
-        static_cast<unsigned long long>(t.loads.merges),
-        static_cast<unsigned long long>(t.loads.mergedByAppend),
-        static_cast<unsigned long long>(t.mergesByInserts),
-        static_cast<unsigned long long>(t.mergesOverEqualKeys),
-        static_cast<unsigned long long>(t.createdResetDestroyedWithPending),
+        static_cast<unsigned long long>(t.loads.engine.gathered),
+        static_cast<unsigned long long>(t.loads.engine.runsWritten),
+        static_cast<unsigned long long>(t.loads.engine.merges),
+        static_cast<unsigned long long>(t.loads.engine.mergedByAppend),
+        static_cast<unsigned long long>(t.loads.mergesByInserts),
+        static_cast<unsigned long long>(t.loads.mergesOverEqualKeys),
+        static_cast<unsigned long long>(t.loads.createdWithPending + t.loads.resetsWithPending +
+                                        t.loads.destroyedWithPending),
         static_cast<unsigned long long>(t.tablesAsMerged),
         static_cast<unsigned long long>(t.tablesNotAsMerged),
         static_cast<unsigned long long>(t.tablesUncertain),
@@ -204,16 +202,8 @@ int main(int argc, char** argv) {
         totals.refusedStored += r.refusedInsertsStored;
         totals.damagedButReadable += r.damagedButReadable;
         totals.runsWritesRefused += result.writesRefused ? 1 : 0;
-        const kovtest::LoadReport& l = result.loads;
         totals.runsTinyLoads += run.tinyLoads ? 1 : 0;
-        totals.loads.gathered += l.engine.gathered;
-        totals.loads.runsWritten += l.engine.runsWritten;
-        totals.loads.merges += l.engine.merges;
-        totals.loads.mergedByAppend += l.engine.mergedByAppend;
-        totals.mergesByInserts += l.mergesByInserts;
-        totals.mergesOverEqualKeys += l.mergesOverEqualKeys;
-        totals.createdResetDestroyedWithPending +=
-            l.createdWithPending + l.resetsWithPending + l.destroyedWithPending;
+        kovtest::addLoads(totals.loads, result.loads);
         totals.entriesLostGathered += r.entriesLostGathered;
         totals.entriesLostMerged += r.entriesLostMerged;
         totals.tablesAsMerged += r.tablesAsMerged;
