@@ -3,6 +3,7 @@
 // fault-injecting VFS registered as the default before the pager opens its engine.
 #include <gtest/gtest.h>
 
+#include <cstdio>
 #include <string>
 
 #include "pager_test_util.h"
@@ -252,7 +253,8 @@ TEST(StoreFaults, TemporaryFileRefusedCostsOnlyTheRefusedInserts) {
 TEST(StoreFaults, WriteErrorHeldForAFewStepsLosesEveryTable) {
     ScopedFaultVfs vfs;
     for (std::uint32_t seed : {3903882125u, 2988472431u}) {
-        const kovtest::RandomFaultRun run(seed);
+        kovtest::RandomFaultRun run(seed);
+        run.tinyLoads = false;  // as found: the engine's default loads
         const kovtest::RandomFaultResult r =
             kovtest::runRandomFaultRun(vfs.faults(), run, 16, false);
         SCOPED_TRACE("run seed " + std::to_string(seed) + ", " + r.plan);
@@ -275,7 +277,8 @@ TEST(StoreFaults, WriteErrorHeldForAFewStepsLosesEveryTable) {
 TEST(StoreFaults, ReadErrorDuringAWalkKeepsEveryTable) {
     ScopedFaultVfs vfs;
     for (std::uint32_t seed : {814766918u, 2060713640u}) {
-        const kovtest::RandomFaultRun run(seed);
+        kovtest::RandomFaultRun run(seed);
+        run.tinyLoads = false;  // as found: the engine's default loads
         const kovtest::RandomFaultResult r =
             kovtest::runRandomFaultRun(vfs.faults(), run, 16, false);
         SCOPED_TRACE("run seed " + std::to_string(seed) + ", " + r.plan);
@@ -300,7 +303,8 @@ TEST(StoreFaults, ReadErrorDuringAWalkKeepsEveryTable) {
 // table of this run answers First with an error; the program then checks nothing more.)
 TEST(StoreFaults, TheStepAfterAFaultIsCheckedAgainstTheEngineReadBack) {
     ScopedFaultVfs vfs;
-    const kovtest::RandomFaultRun run(1090849953u);
+    kovtest::RandomFaultRun run(1090849953u);
+    run.tinyLoads = false;  // as found: the engine's default loads
     const kovtest::RandomFaultResult r = kovtest::runRandomFaultRun(vfs.faults(), run, 16, false);
     SCOPED_TRACE(r.plan);
     EXPECT_EQ(run.kind, FaultPlan::Kind::Read);
@@ -318,10 +322,247 @@ TEST(StoreFaults, TheStepAfterAFaultIsCheckedAgainstTheEngineReadBack) {
 // matches.
 TEST(StoreFaults, RegressionSeed70416396FetchOnACursorReopenedOnAnIntegerTable) {
     ScopedFaultVfs vfs;
-    const kovtest::RandomFaultRun run(70416396u);
+    kovtest::RandomFaultRun run(70416396u);
+    run.tinyLoads = false;  // as found: the engine's default loads
     const kovtest::RandomFaultResult r = kovtest::runRandomFaultRun(vfs.faults(), run, 16, false);
     EXPECT_TRUE(run.allowReset);
     EXPECT_EQ(r.report.faultedSteps, 0u);
     EXPECT_EQ(r.operations, static_cast<std::uint64_t>(kovtest::RandomFaultRun::kSteps));
     EXPECT_EQ(r.mismatches, 0u);
+}
+
+// ---- Faults on the way of gathered inserts ---------------------------------------------------
+
+namespace {
+
+// Tiny loads (a buffer of about 1 KiB, gathered from the second insert after a read) and an
+// engine cache of 16 pages: runs are written and merged through the temporary file within a
+// few hundred inserts, and the faults meet them there.
+constexpr int kLoadSteps = 6000;
+
+ProgramOptions tinyLoads() {
+    ProgramOptions o;
+    o.allowReset = false;
+    // Two tables: buffers of equal size (which one the engine writes out first the model cannot
+    // tell) are rare.
+    o.maxTables = 2;
+    o.maxCursors = 4;
+    o.insertPercent = 75;
+    // Records of 60..180 bytes: few enough to a buffer for runs of a few entries, small enough
+    // to be gathered (an entry of more than a quarter of the buffer goes straight in).
+    o.bigPercent = 100;
+    o.bigMin = 60;
+    o.bigMax = 180;
+    o.wideKeys = true;
+    o.destroyTablePercent = 0;
+    o.readerPercent = 5;
+    o.loads = kov::engine::test::kTinyLoads;
+    o.onEngineOpened = [] { kov::engine::sqlite3BtreeSetCacheSize(KovTestAccess::engine(), 16); };
+    return o;
+}
+
+struct LoadOutcome {
+    kovtest::FaultReport report;
+    kovtest::LoadReport loads;
+    std::uint64_t mismatches = 0;
+    std::string firstMismatch;
+    bool fired = false;
+    bool writesRefused = false;
+    bool degraded = false;
+    std::string failure;
+    std::uint64_t reads = 0;
+    std::uint64_t writes = 0;
+};
+
+LoadOutcome runLoads(FaultPlan::Kind kind, std::uint64_t n, FaultMode mode, bool armFault) {
+    LoadOutcome out;
+    ScopedFaultVfs vfs;
+    FaultPlan plan(vfs.faults(), kind, n, mode, 20);
+    SeededChoices choices(kSeed);
+    StoreProgram program(choices, plan.options(tinyLoads()));
+    program.begin();
+    if (armFault)
+        plan.arm();
+    for (int i = 0; i < kLoadSteps; ++i) {
+        program.step();
+        plan.afterStep();
+    }
+    plan.disarm();
+    program.step();  // resync if needed
+    out.degraded = program.degraded();
+    out.writesRefused = program.writesRefused();
+    out.failure = KovPager::instance()->failure();
+    out.reads = vfs.faults().calls(FaultKind::Read);
+    out.writes = vfs.faults().calls(FaultKind::Write);
+    program.end();
+    out.report = program.faultReport();
+    out.loads = program.loadReport();
+    out.mismatches = program.mismatches();
+    out.firstMismatch = program.firstMismatch();
+    out.fired = plan.fired();
+    return out;
+}
+
+const LoadOutcome& cleanLoadRun() {
+    static const LoadOutcome clean =
+        runLoads(FaultPlan::Kind::Read, 1, FaultMode::Once, false);
+    return clean;
+}
+
+std::string describeLoads(const LoadOutcome& o) {
+    const kovtest::FaultReport& r = o.report;
+    std::string s = "tables as merged " + std::to_string(r.tablesAsMerged) + " / not " +
+                    std::to_string(r.tablesNotAsMerged) + " / uncertain " +
+                    std::to_string(r.tablesUncertain) + ", broken " +
+                    std::to_string(r.tablesBroken) + ", entries lost " +
+                    std::to_string(r.entriesLost) + " (gathered " +
+                    std::to_string(r.entriesLostGathered) + ", merged " +
+                    std::to_string(r.entriesLostMerged) + "), damaged but readable " +
+                    std::to_string(r.damagedButReadable) + ", failure: " + o.failure +
+                    ", first mismatch: " + o.firstMismatch;
+    for (std::size_t i = 0; i < r.faultedActions.size(); ++i)
+        s += "\n  faulted: " + r.faultedActions[i] + " [" + r.faultedLoadWork[i] + "]";
+    return s;
+}
+
+bool isInsert(const std::string& action) { return action.rfind("insert", 0) == 0; }
+
+}  // namespace
+
+// Without faults the program writes runs and merges them by inserts in key order, through a
+// temporary file that is read back.
+TEST(StoreLoadFaults, TinyLoadsGoThroughTheTemporaryFile) {
+    const LoadOutcome& o = cleanLoadRun();
+    SCOPED_TRACE(describeLoads(o));
+    EXPECT_EQ(o.mismatches, 0u);
+    EXPECT_FALSE(o.fired);
+    EXPECT_GT(o.loads.engine.runsWritten, 10u);
+    EXPECT_GT(o.loads.mergesByInserts, 10u);
+    EXPECT_GT(o.reads, 100u);
+    EXPECT_GT(o.writes, 100u);
+}
+
+// A failed read while a run is written or while a load is merged, once or held for 20 steps, at
+// points spread over the run: the failure is told as a failure "inserting an entry", every entry
+// the model knows was merged (inserted before the last read of its table, or straight in) reads
+// back, and the entries lost are exactly those still gathered at the failure (a table merged
+// during the failing step may hold any part of that merge). Every answer before the fault and
+// after it matches the model.
+TEST(StoreLoadFaults, ReadErrorsWhileWritingARunOrMergingLoseOnlyWhatWasGathered) {
+    const std::uint64_t reads = cleanLoadRun().reads;
+    ASSERT_GT(reads, 100u);
+    int duringRun = 0;
+    int duringMerge = 0;
+    int damaged = 0;
+    std::uint64_t gatheredLost = 0;
+    for (FaultMode mode : {FaultMode::Once, FaultMode::Persistent}) {
+        for (std::uint64_t i = 1; i <= 24; ++i) {
+            const std::uint64_t n = reads * i / 25;
+            LoadOutcome o = runLoads(FaultPlan::Kind::Read, n, mode, true);
+            SCOPED_TRACE(std::string(mode == FaultMode::Once ? "once" : "persistent") +
+                         " at read " + std::to_string(n) + ": " + describeLoads(o));
+            ASSERT_TRUE(o.fired);
+            ASSERT_FALSE(o.report.faultedActions.empty());
+            if (o.report.damagedButReadable != 0) {
+                // A merge the read error stopped half-way left the database damaged and lost
+                // entries merged before it: StoreLoadFaults.ReadErrorWhileMergingKeepsWhatWasMerged
+                // holds one such point. The others are checked exactly.
+                ++damaged;
+                continue;
+            }
+            const std::string& action = o.report.faultedActions[0];
+            const std::string& work = o.report.faultedLoadWork[0];
+            const bool inserting = o.failure.find("failed while inserting an entry: ") != std::string::npos;
+            if (inserting && isInsert(action) && work.find("run") != std::string::npos)
+                ++duringRun;
+            if (inserting && !isInsert(action) && work.find("merge") != std::string::npos)
+                ++duringMerge;
+            // Not an insert, yet failed inserting: only a merge inserts then.
+            if (inserting && !isInsert(action)) {
+                EXPECT_NE(work.find("merge"), std::string::npos);
+            }
+            EXPECT_EQ(o.mismatches, 0u);
+            EXPECT_TRUE(o.writesRefused);
+            EXPECT_FALSE(o.degraded);
+            EXPECT_EQ(o.report.tablesBroken, 0u);
+            EXPECT_EQ(o.report.tablesUncertain, 0u);
+            EXPECT_EQ(o.report.tablesNotAsMerged, 0u);
+            EXPECT_GT(o.report.tablesAsMerged, 0u);
+            EXPECT_EQ(o.report.entriesLostMerged, 0u);
+            EXPECT_EQ(o.report.entriesLost, o.report.entriesLostGathered);
+            gatheredLost += o.report.entriesLostGathered;
+        }
+    }
+    std::printf("read faults while a run was written: %d, while a load was merged: %d, leaving a "
+                "damaged database: %d; gathered entries lost: %llu\n",
+                duringRun, duringMerge, damaged, static_cast<unsigned long long>(gatheredLost));
+    EXPECT_GT(duringRun, 0);
+    EXPECT_GT(duringMerge, 0);
+    EXPECT_GT(gatheredLost, 0u);
+}
+
+// A failed write, or a full disk, on the same path: the documented outcome is unchanged, every
+// table the host can reach reads back as damaged and writes are refused from then on; nothing
+// crashes, and no answer before the fault differs from the model.
+TEST(StoreLoadFaults, WriteErrorsAndAFullDiskWhileLoadingLoseEveryTable) {
+    const std::uint64_t writes = cleanLoadRun().writes;
+    ASSERT_GT(writes, 10u);
+    struct Point {
+        FaultPlan::Kind kind;
+        FaultMode mode;
+        std::uint64_t n;
+    };
+    const Point points[] = {
+        {FaultPlan::Kind::Write, FaultMode::Once, writes / 3},
+        {FaultPlan::Kind::Write, FaultMode::Persistent, writes / 2},
+        {FaultPlan::Kind::FullDisk, FaultMode::Once, 64 * 1024},
+    };
+    for (const Point& p : points) {
+        LoadOutcome o = runLoads(p.kind, p.n, p.mode, true);
+        SCOPED_TRACE(std::string(FaultPlan::name(p.kind)) + " at " + std::to_string(p.n) + ": " +
+                     describeLoads(o));
+        ASSERT_TRUE(o.fired);
+        EXPECT_EQ(o.mismatches, 0u);
+        EXPECT_TRUE(o.writesRefused);
+        EXPECT_TRUE(o.degraded);
+        EXPECT_EQ(o.report.tablesIntact, 0u);
+        EXPECT_EQ(o.report.tablesAsMerged, 0u);
+        EXPECT_GE(o.report.tablesBroken, 1u);
+        EXPECT_NE(o.failure.find(p.kind == FaultPlan::Kind::FullDisk ? "database or disk is full"
+                                                                      : "disk I/O error"),
+                  std::string::npos);
+    }
+}
+
+// A read error once, at read call 605 of the tiny-loads program of seed 1: it meets a merge (the
+// step is a walk, whose First merges what its table gathered) and the failure is told as one
+// "inserting an entry". What was merged into the tables before that merge must read back as
+// before, and the database must stay sound. Today 56 entries merged earlier are missing from a
+// table that reads back without error, and SQLite's integrity check finds the database damaged.
+TEST(StoreLoadFaults, ReadErrorWhileMergingKeepsWhatWasMerged) {
+    LoadOutcome o = runLoads(FaultPlan::Kind::Read, 605, FaultMode::Once, true);
+    SCOPED_TRACE(describeLoads(o));
+    ASSERT_TRUE(o.fired);
+    ASSERT_EQ(o.report.faultedLoadWork.size(), 1u);
+    EXPECT_EQ(o.report.faultedLoadWork[0], "merge");
+    EXPECT_NE(o.failure.find("failed while inserting an entry: "), std::string::npos);
+    EXPECT_EQ(o.report.entriesLostMerged, 0u);
+    EXPECT_EQ(o.report.tablesNotAsMerged, 0u);
+    EXPECT_EQ(o.report.damagedButReadable, 0u);
+}
+
+// Found by the soak program (run seed 2098357253, tiny loads, no fault fires; the engine's cache
+// cut to 16 pages; records of a few KB among them, too large to be gathered, go straight in
+// after what their table gathered): at step 730 a walk reads an entry whose data is 4138 bytes
+// long where the model, which follows every insert in order, holds 5215. The model's contents do
+// not depend on how loads are gathered, so the store answers what it did not store last. Every
+// answer must match the model.
+TEST(StoreLoadFaults, RegressionSeed2098357253NewestInsertWinsWithoutFaults) {
+    ScopedFaultVfs vfs;
+    const kovtest::RandomFaultRun run(2098357253u);
+    const kovtest::RandomFaultResult r = kovtest::runRandomFaultRun(vfs.faults(), run, 16, false);
+    SCOPED_TRACE(r.plan);
+    EXPECT_TRUE(run.tinyLoads);
+    EXPECT_EQ(r.report.faultedSteps, 0u);
+    EXPECT_EQ(r.mismatches, 0u) << (r.mismatchTexts.empty() ? "" : r.mismatchTexts.front());
 }

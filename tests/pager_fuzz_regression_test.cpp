@@ -14,17 +14,40 @@
 // runs in every build; the inputs the fuzzer found follow as regression tests.
 TEST(StoreFuzz, StoreByteProgramsMatchTheModel) {
     std::mt19937 gen(2026);
-    for (int input = 0; input < 40; ++input) {
+    for (int input = 0; input < 48; ++input) {
         std::vector<std::uint8_t> bytes(200 + static_cast<std::size_t>(input) * 50);
         for (auto& b : bytes)
             b = static_cast<std::uint8_t>(gen());
-        bytes[0] = static_cast<std::uint8_t>(input & 7);
+        bytes[0] = static_cast<std::uint8_t>(input & 15);
         kovtest::ByteChoices choices(bytes.data() + 1, bytes.size() - 1);
         kovtest::StoreProgram program(choices, kovtest::fuzzVariant(bytes[0]));
         program.run(1000);
         EXPECT_GT(program.operations(), 0u);
         EXPECT_EQ(program.mismatches(), 0u) << "input " << input << ": " << program.firstMismatch();
     }
+}
+
+// The variants with tiny loads (bit 3 of the first byte): byte programs whose inserts are
+// gathered, written out in runs and merged, and whose every step matches the model and its
+// account of the engine's load statistics.
+TEST(StoreFuzz, TinyLoadByteProgramsWriteRunsAndMerge) {
+    std::mt19937 gen(2027);
+    kovtest::LoadReport sum;
+    for (int input = 0; input < 16; ++input) {
+        std::vector<std::uint8_t> bytes(6000);
+        for (auto& b : bytes)
+            b = static_cast<std::uint8_t>(gen());
+        bytes[0] = static_cast<std::uint8_t>(8 | (input & 7));
+        kovtest::ByteChoices choices(bytes.data() + 1, bytes.size() - 1);
+        kovtest::StoreProgram program(choices, kovtest::fuzzVariant(bytes[0]));
+        program.run(1000);
+        EXPECT_EQ(program.mismatches(), 0u) << "input " << input << ": " << program.firstMismatch();
+        kovtest::addLoads(sum, program.loadReport());
+    }
+    EXPECT_GT(sum.engine.gathered, 0u);
+    EXPECT_GT(sum.engine.runsWritten, 0u);
+    EXPECT_GT(sum.engine.merges, 0u);
+    EXPECT_GT(sum.statsChecked, 1000u);
 }
 
 // An empty program and a program of zeros (every choice the first one) end cleanly.

@@ -11,6 +11,7 @@
 #include <utility>
 
 #include "engine/btree.h"
+#include "engine/sorted_load.h"
 #include "engine_test_util.h"
 #include "kov_test_access.h"
 
@@ -47,6 +48,7 @@ class StoreProgram::Impl {
         KovPager::instance()->reset();
         KovTestAccess::teardown();
         engineOpen_ = false;
+        restartLoads();
         db_.clear();
         slots_.clear();
         step_ = 0;
@@ -62,9 +64,11 @@ class StoreProgram::Impl {
     void end() {
         if (dirty_ && !armed() && !unmodelled_)
             resync();
+        harvestLoadStats();
         clearHost();
         disposeCopies();
         KovTestAccess::teardown();
+        engineOpen_ = false;
     }
 
     std::uint64_t steps() const { return static_cast<std::uint64_t>(step_); }
@@ -77,6 +81,12 @@ class StoreProgram::Impl {
     const std::vector<std::string>& mismatchTexts() const { return texts_; }
     std::string firstMismatch() const { return texts_.empty() ? std::string() : texts_.front(); }
     const FaultReport& faultReport() const { return report_; }
+    const LoadReport& loadReport() {
+        loadReport_.engine = loadTotals_;
+        if (engineOpen_ && KovTestAccess::engine() != nullptr)
+            addLoads(loadReport_.engine, kov::engine::TEST_loadStats(KovTestAccess::engine()));
+        return loadReport_;
+    }
     bool stopped() const { return stopped_; }
     // Bytes of data the model holds (what the store should hold).
     std::uint64_t modelBytes() const {
@@ -102,12 +112,40 @@ class StoreProgram::Impl {
     }
 
   private:
+    // One insert the engine gathered and has not merged: in run `batch` when the table has
+    // written more than `batch` runs, else in its buffer.
+    struct Gathered {
+        std::int64_t ik = 0;
+        std::string bk;
+        std::string data;
+        std::uint32_t batch = 0;
+    };
+    // What a merge did to one key: what it held before (if anything), what it holds after.
+    struct MergeChange {
+        bool hadOld = false;
+        std::string old;
+        std::string now;
+    };
+    // A table's load as the engine keeps it (engine/btree.cpp).
+    struct LoadModel {
+        std::uint32_t insertsSinceRead = 0;
+        bool pending = false;  // the engine holds a load for the table (maybe an empty one)
+        std::uint32_t runs = 0;
+        std::size_t bufferBytes = 0;  // the footprints of the entries in the buffer
+        std::vector<Gathered> entries;  // not merged, oldest first
+        bool uncertain = false;  // see LoadReport::ambiguousSpills
+    };
     struct ModelTable {
         bool intKey = false;
         bool hasData = true;
         bool broken = false;
+        // What every read answers: what was merged with what was gathered over it.
         std::map<std::string, std::string> bytes;
         std::map<std::int64_t, std::string> ints;
+        // What the table's B-tree holds.
+        std::map<std::string, std::string> mergedBytes;
+        std::map<std::int64_t, std::string> mergedInts;
+        LoadModel load;
         bool empty() const { return intKey ? ints.empty() : bytes.empty(); }
         std::size_t size() const { return intKey ? ints.size() : bytes.size(); }
     };
@@ -182,6 +220,7 @@ class StoreProgram::Impl {
             leaveTheModel();
         } else if (a == 3) {
             last_ = "reset through a copy";
+            harvestLoadStats();
             copy.reset();
             leaveTheModel();
         } else if (a == 4) {
@@ -231,6 +270,8 @@ class StoreProgram::Impl {
         unchecked_ = false;
         lastInsertRoot_ = 0;
         lastSlot_ = -1;
+        stepWork_.clear();
+        stepMerges_.clear();
         oneStep();
         ++operations_;
         const bool faulted = events() != before;
@@ -248,12 +289,26 @@ class StoreProgram::Impl {
             if (lastInsertRoot_ != 0)
                 refused_.push_back({lastInsertRoot_, lastInsertKey_});
             ++report_.faultedSteps;
-            if (report_.faultedActions.size() < 8)
+            if (report_.faultedActions.size() < 8) {
                 report_.faultedActions.push_back(last_);
+                report_.faultedLoadWork.push_back(
+                    stepWork_.empty() ? std::string() : stepWork_.substr(1));
+            }
+            for (auto& [root, changes] : stepMerges_) {
+                std::map<std::string, MergeChange>& kept = faultMerges_[root];
+                for (auto& [key, change] : changes) {
+                    auto it = kept.find(key);
+                    if (it == kept.end())
+                        kept.emplace(key, change);
+                    else
+                        it->second.now = change.now;
+                }
+            }
             dirty_ = true;
         }
         if (!faulted && !dirty_ && !degraded_) {
             check();
+            checkLoadStats();
             if (!unchecked_)
                 commitPending();
         }
@@ -408,7 +463,10 @@ class StoreProgram::Impl {
         const bool opening = !engineOpen_;
         if (opening) {
             engineOpen_ = true;
+            restartLoads();
             db_.clear();
+        } else if (!writesRefused_ && anyPendingEntries()) {
+            ++loadReport_.createdWithPending;
         }
         std::vector<std::string> saved(slots_.size());
         std::vector<bool> savedKnown(slots_.size(), true);
@@ -482,6 +540,15 @@ class StoreProgram::Impl {
                 moveBytes(s, *on, saved[i]);
             }
         }
+        // Every reopened cursor searched its saved key: a read of its table (a saved integer key
+        // is refused by a byte-string table before any search).
+        for (const ModelSlot& s : slots_) {
+            if (!s.live || s.handle != Handle::Open)
+                continue;
+            ModelTable* on = tableAt(s.root);
+            if (on != nullptr && ((s.flags & 1) == 0 || on->intKey))
+                loadRead(s.root);
+        }
         if (degraded)
             adoptHandles();
     }
@@ -506,8 +573,12 @@ class StoreProgram::Impl {
         }
         tables_.erase(tables_.begin() + static_cast<std::ptrdiff_t>(i));
         // Refused while a cursor is open, and while the engine refuses writes.
-        if (engineOpen_ && !anyOpen() && !writesRefused_ && root != 0)
+        if (engineOpen_ && !anyOpen() && !writesRefused_ && root != 0) {
+            ModelTable* t = tableAt(root);
+            if (t != nullptr && pendingEntries(*t))
+                ++loadReport_.destroyedWithPending;
             db_.erase(root);
+        }
     }
 
     void openCursor() {
@@ -538,6 +609,8 @@ class StoreProgram::Impl {
                  "slot index");
         slots_.push_back(s);
         cursors_.push_back(std::move(c));
+        if (!write && engineOpen_)
+            loadRead(t->root);  // a read cursor: what the table gathered goes in first
         if (anyBroken())
             adoptHandles();
     }
@@ -562,8 +635,12 @@ class StoreProgram::Impl {
 
     void reset() {
         last_ = "reset";
+        if (engineOpen_ && !writesRefused_ && anyPendingEntries())
+            ++loadReport_.resetsWithPending;
+        harvestLoadStats();
         KovPager::instance()->reset();
         engineOpen_ = false;
+        restartLoads();
         db_.clear();
         ++generation_;
         for (auto& s : slots_) {
@@ -615,11 +692,6 @@ class StoreProgram::Impl {
             form = 2;
         bool changed = false;
         std::string lastKey;  // the entry's key as the model holds it (8 bytes for integers)
-        auto intKeyText = [](std::int64_t k) {
-            std::string text(8, '\0');
-            std::memcpy(&text[0], &k, 8);
-            return text;
-        };
         if (form == 0) {
             std::int64_t k = randomInt();
             std::string d = randomData();
@@ -629,6 +701,7 @@ class StoreProgram::Impl {
                 t->ints[k] = t->hasData ? d : "";
                 changed = true;
                 lastKey = intKeyText(k);
+                loadInsert(s.root, *t, k, std::string(), t->ints[k]);
             }
             // A byte-string table refuses an integer key: nothing changes.
         } else if (form == 1) {
@@ -642,6 +715,7 @@ class StoreProgram::Impl {
                     t->bytes[k] = "";
                 changed = true;
                 lastKey = t->intKey ? intKeyText(static_cast<std::int64_t>(k.size())) : k;
+                loadInsert(s.root, *t, static_cast<std::int64_t>(k.size()), k, std::string());
             }
         } else {
             std::string k = randomBytes();
@@ -656,6 +730,8 @@ class StoreProgram::Impl {
                     t->bytes[k] = t->hasData ? d : "";
                 changed = true;
                 lastKey = t->intKey ? intKeyText(static_cast<std::int64_t>(k.size())) : k;
+                loadInsert(s.root, *t, static_cast<std::int64_t>(k.size()), k,
+                           t->hasData ? d : std::string());
             }
         }
         if (changed) {
@@ -678,13 +754,17 @@ class StoreProgram::Impl {
             std::int64_t k = randomInt();
             last_ = "seek int " + std::to_string(k);
             got = c.obj->seek(k);
-            if (t != nullptr && t->intKey)
+            if (t != nullptr && t->intKey) {
+                loadRead(s.root);
                 expected = moveInt(s, *t, k);
+            }
             // A byte-string table refuses the integer form: the cursor stays where it was.
         } else {
             std::string k = randomBytes();
             last_ = "seek bytes, " + std::to_string(k.size()) + " bytes";
             got = c.obj->seek(k.data(), k.size());
+            if (t != nullptr)
+                loadRead(s.root);
             if (t != nullptr && t->intKey)
                 expected = moveInt(s, *t, static_cast<std::int64_t>(k.size()));
             else if (t != nullptr)
@@ -719,6 +799,8 @@ class StoreProgram::Impl {
                 break;
         }
         bool expected = false;
+        if (t != nullptr && which < 2)
+            loadRead(s.root);  // First and Last
         if (t != nullptr) {
             if (t->intKey)
                 expected = stepIn(t->ints, s.ik, s.on, which);
@@ -788,6 +870,8 @@ class StoreProgram::Impl {
         last_ = "indexKeySeek " + std::to_string(k.size()) + " bytes";
         bool got = c.obj->indexKeySeek(k.data(), k.size());
         bool expected = false;
+        if (t != nullptr)
+            loadRead(s.root);
         if (t != nullptr && t->intKey) {
             // An integer table takes the length as the key; below every key, the cursor steps
             // off the end.
@@ -846,6 +930,8 @@ class StoreProgram::Impl {
             if (guard == 0) {
                 last_ = "walk: first";
                 got = c.obj->first();
+                if (t != nullptr)
+                    loadRead(s.root);
                 if (t != nullptr)
                     expected = t->intKey ? stepIn(t->ints, s.ik, s.on, 0)
                                          : stepIn(t->bytes, s.bk, s.on, 0);
@@ -943,6 +1029,291 @@ class StoreProgram::Impl {
             c->obj->key(k);
             expectEq(k, keySizeOf(s), "key");
         }
+    }
+
+    // ---- loads -------------------------------------------------------------------------------
+
+    // The statistics of the engine about to close go into the run's sum.
+    void harvestLoadStats() {
+        if (engineOpen_ && KovTestAccess::engine() != nullptr)
+            addLoads(loadTotals_, kov::engine::TEST_loadStats(KovTestAccess::engine()));
+    }
+    static std::string intKeyText(std::int64_t k) {
+        std::string text(8, '\0');
+        std::memcpy(&text[0], &k, 8);
+        return text;
+    }
+    static bool pendingEntries(const ModelTable& t) { return !t.load.entries.empty(); }
+    bool anyPendingEntries() const {
+        for (const auto& [root, t] : db_) {
+            (void)root;
+            if (pendingEntries(t))
+                return true;
+        }
+        return false;
+    }
+    bool anyUncertain() const {
+        for (const auto& [root, t] : db_) {
+            (void)root;
+            if (t.load.uncertain)
+                return true;
+        }
+        return false;
+    }
+    // Key order of gathered entries (the engine's, as std::map's).
+    static bool keyBefore(const ModelTable& t, const Gathered& a, const Gathered& b) {
+        return t.intKey ? a.ik < b.ik : a.bk < b.bk;
+    }
+    // Whether every one of `entries` lies above the B-tree's last key (an empty B-tree always).
+    static bool appendsAfterMerged(const ModelTable& t, const std::vector<Gathered>& entries) {
+        if (entries.empty())
+            return false;
+        const Gathered* smallest = &entries.front();
+        for (const Gathered& g : entries) {
+            if (keyBefore(t, g, *smallest))
+                smallest = &g;
+        }
+        if (t.intKey)
+            return t.mergedInts.empty() || smallest->ik > t.mergedInts.rbegin()->first;
+        return t.mergedBytes.empty() || smallest->bk > t.mergedBytes.rbegin()->first;
+    }
+    // Puts gathered entries into the B-tree's content, oldest first (the newest wins), and keeps
+    // what each key held before, in case a fault stops the merge half-way.
+    void mergeEntries(std::uint32_t root, ModelTable& t, const std::vector<Gathered>& entries) {
+        std::map<std::string, MergeChange>& changes = stepMerges_[root];
+        for (const Gathered& g : entries) {
+            const std::string key = t.intKey ? intKeyText(g.ik) : g.bk;
+            auto seen = changes.find(key);
+            if (seen == changes.end()) {
+                MergeChange change;
+                if (t.intKey) {
+                    auto it = t.mergedInts.find(g.ik);
+                    change.hadOld = it != t.mergedInts.end();
+                    if (change.hadOld)
+                        change.old = it->second;
+                } else {
+                    auto it = t.mergedBytes.find(g.bk);
+                    change.hadOld = it != t.mergedBytes.end();
+                    if (change.hadOld)
+                        change.old = it->second;
+                }
+                seen = changes.emplace(key, change).first;
+            }
+            seen->second.now = g.data;
+            if (t.intKey)
+                t.mergedInts[g.ik] = g.data;
+            else
+                t.mergedBytes[g.bk] = g.data;
+        }
+    }
+    static void clearLoad(ModelTable& t) {
+        const std::uint32_t inserts = t.load.insertsSinceRead;
+        t.load = LoadModel{};
+        t.load.insertsSinceRead = inserts;
+    }
+    // Whether two runs of the load hold an equal key.
+    static bool runsShareAKey(const ModelTable& t) {
+        std::map<std::string, std::uint32_t> firstRun;
+        for (const Gathered& g : t.load.entries) {
+            if (g.batch >= t.load.runs)
+                continue;  // in the buffer
+            const std::string key = t.intKey ? intKeyText(g.ik) : g.bk;
+            auto it = firstRun.emplace(key, g.batch).first;
+            if (it->second != g.batch)
+                return true;
+        }
+        return false;
+    }
+    // What the table gathered goes into its B-tree (a read, or an insert straight in).
+    void mergeLoad(std::uint32_t root, ModelTable& t) {
+        if (!t.load.pending)
+            return;
+        if (writesRefused_) {
+            clearLoad(t);  // the engine refuses writes: what was gathered is lost
+            return;
+        }
+        ++expect_.merges;
+        if (!t.load.entries.empty()) {
+            stepWork_ += " merge";
+            if (appendsAfterMerged(t, t.load.entries))
+                ++expect_.mergedByAppend;
+            else
+                ++loadReport_.mergesByInserts;
+            if (runsShareAKey(t))
+                ++loadReport_.mergesOverEqualKeys;
+            mergeEntries(root, t, t.load.entries);
+        }
+        clearLoad(t);
+    }
+    // A read of the table: First, Last or a move-to on any of its cursors, a read cursor opened.
+    void loadRead(std::uint32_t root) {
+        ModelTable* t = tableAt(root);
+        if (t == nullptr)
+            return;
+        if (t->load.insertsSinceRead > 0)
+            ++loadReport_.readsBetweenInserts;
+        t->load.insertsSinceRead = 0;
+        mergeLoad(root, *t);
+    }
+    std::size_t gatheredBytes() const {
+        std::size_t n = 0;
+        for (const auto& [root, t] : db_) {
+            (void)root;
+            n += t.load.bufferBytes;
+        }
+        return n;
+    }
+    // The load memory is full: the largest buffer is appended to its table, or written as a run.
+    void spillLargest() {
+        std::size_t largest = 0;
+        std::vector<std::uint32_t> candidates;
+        for (const auto& [root, t] : db_) {
+            if (!t.load.pending || t.load.bufferBytes < largest || t.load.bufferBytes == 0)
+                continue;
+            if (t.load.bufferBytes > largest)
+                candidates.clear();
+            largest = t.load.bufferBytes;
+            candidates.push_back(root);
+        }
+        if (candidates.empty())
+            return;
+        if (candidates.size() > 1 || anyUncertain()) {
+            ++loadReport_.ambiguousSpills;
+            for (auto& [root, t] : db_) {
+                (void)root;
+                if (t.load.pending)
+                    t.load.uncertain = true;
+            }
+            restartStats_ = true;
+        }
+        const std::uint32_t root = candidates.front();
+        ModelTable& t = db_[root];
+        if (t.load.runs == 0 && appendsAfterMerged(t, t.load.entries)) {
+            stepWork_ += " append";
+            ++expect_.merges;
+            ++expect_.mergedByAppend;
+            mergeEntries(root, t, t.load.entries);
+            t.load.entries.clear();
+        } else {
+            stepWork_ += " run";
+            ++t.load.runs;
+            ++expect_.runsWritten;
+        }
+        t.load.bufferBytes = 0;
+    }
+    // An insert the engine took: gathered, or straight into the B-tree after what was gathered.
+    void loadInsert(std::uint32_t root, ModelTable& t, std::int64_t ik, const std::string& bk,
+                    const std::string& data) {
+        const kov::engine::LoadLimits& limits = opt_.loads;
+        const std::size_t need = kov::engine::LoadBuffer::footprint(
+            t.intKey ? 0 : static_cast<std::uint32_t>(bk.size()),
+            static_cast<std::uint32_t>(data.size()));
+        const bool gathering =
+            t.load.insertsSinceRead >= limits.directInserts && need <= limits.bufferBytes / 4;
+        if (t.load.insertsSinceRead < UINT32_MAX)
+            ++t.load.insertsSinceRead;
+        if (!gathering) {
+            mergeLoad(root, t);
+            if (t.intKey)
+                t.mergedInts[ik] = data;
+            else
+                t.mergedBytes[bk] = data;
+            return;
+        }
+        if (gatheredBytes() + need > limits.bufferBytes)
+            spillLargest();
+        ModelTable& into = db_[root];  // (the same table: spilling adds none)
+        Gathered g;
+        g.ik = ik;
+        g.bk = bk;
+        g.data = data;
+        g.batch = into.load.runs;
+        into.load.pending = true;
+        into.load.entries.push_back(std::move(g));
+        into.load.bufferBytes += need;
+        ++expect_.gathered;
+    }
+    // After a checked step: the engine's load statistics are the model's.
+    void checkLoadStats() {
+        if (!engineOpen_ || KovTestAccess::engine() == nullptr || unmodelled_ ||
+            faultSinceReset_ || writesRefused_ || anyUncertain())
+            return;
+        const kov::engine::LoadStats got = kov::engine::TEST_loadStats(KovTestAccess::engine());
+        if (restartStats_) {
+            // Uncertain no longer: follow the engine's figures from here.
+            expect_ = got;
+            restartStats_ = false;
+            return;
+        }
+        expectEq(got.gathered, expect_.gathered, "inserts gathered");
+        expectEq(got.runsWritten, expect_.runsWritten, "runs written");
+        expectEq(got.merges, expect_.merges, "loads merged");
+        expectEq(got.mergedByAppend, expect_.mergedByAppend, "loads merged by appending");
+        ++loadReport_.statsChecked;
+    }
+    // A fresh engine: nothing gathered, no statistics.
+    void restartLoads() {
+        expect_ = kov::engine::LoadStats{};
+        restartStats_ = false;
+    }
+
+    // Compares a table read back after a fault that ended the writes with what the model knows
+    // was merged into it (`refused`: keys of inserts the fault met, which may or may not be
+    // there).
+    template <typename Map, typename KeyText>
+    void classifyMerged(std::uint32_t root, const Map& current, const Map& merged,
+                        const Map& truth, const std::vector<std::string>& refused,
+                        KeyText keyText) {
+        const std::map<std::string, MergeChange>* partial = nullptr;
+        auto found = faultMerges_.find(root);
+        if (found != faultMerges_.end())
+            partial = &found->second;
+        auto skip = [&](const std::string& key) {
+            for (const auto& r : refused) {
+                if (r == key)
+                    return true;
+            }
+            return false;
+        };
+        std::uint64_t lostMerged = 0;
+        std::uint64_t lostGathered = 0;
+        std::uint64_t extra = 0;
+        for (const auto& e : merged) {
+            const std::string key = keyText(e.first);
+            if (skip(key))
+                continue;
+            auto it = truth.find(e.first);
+            bool ok = it != truth.end() && it->second == e.second;
+            if (!ok && partial != nullptr) {
+                // Merged half-way: the key may still hold what it held before the merge, and
+                // then lost an entry that was still gathered.
+                auto change = partial->find(key);
+                if (change != partial->end()) {
+                    const MergeChange& c = change->second;
+                    ok = c.hadOld ? it != truth.end() && it->second == c.old : it == truth.end();
+                    lostGathered += ok ? 1 : 0;
+                }
+            }
+            lostMerged += ok ? 0 : 1;
+        }
+        for (const auto& e : truth) {
+            const std::string key = keyText(e.first);
+            if (skip(key) || merged.count(e.first) != 0)
+                continue;
+            ++extra;  // neither merged nor held before a merge (those are in `merged` too)
+        }
+        for (const auto& e : current) {
+            if (skip(keyText(e.first)))
+                continue;
+            auto m = merged.find(e.first);
+            auto it = truth.find(e.first);
+            const bool wasGathered = m == merged.end() || m->second != e.second;
+            if (wasGathered && (it == truth.end() || it->second != e.second))
+                ++lostGathered;
+        }
+        report_.entriesLostMerged += lostMerged;
+        report_.entriesLostGathered += lostGathered;
+        ++(lostMerged == 0 && extra == 0 ? report_.tablesAsMerged : report_.tablesNotAsMerged);
     }
 
     // ---- faults ------------------------------------------------------------------------------
@@ -1066,6 +1437,20 @@ class StoreProgram::Impl {
         if (cur != nullptr)
             eng::sqlite3BtreeCloseCursor(cur);
         truth.broken = rc != kEngineOk;
+        if (classify && writesRefused_) {
+            std::vector<std::string> refused;
+            for (const auto& r : refused_) {
+                if (r.first == root)
+                    refused.push_back(r.second);
+            }
+            if (t.load.uncertain)
+                ++report_.tablesUncertain;
+            else if (!truth.broken && t.intKey)
+                classifyMerged(root, t.ints, t.mergedInts, truth.ints, refused, intKeyText);
+            else if (!truth.broken)
+                classifyMerged(root, t.bytes, t.mergedBytes, truth.bytes, refused,
+                               [](const std::string& k) { return k; });
+        }
         if (classify) {
             std::uint64_t lost = 0;
             std::uint64_t extra = 0;
@@ -1112,6 +1497,8 @@ class StoreProgram::Impl {
             else
                 ++report_.tablesIntact;
         }
+        truth.mergedInts = truth.ints;
+        truth.mergedBytes = truth.bytes;
         t = std::move(truth);
     }
 
@@ -1140,6 +1527,7 @@ class StoreProgram::Impl {
             if (slots_[i].live)
                 adoptPosition(i);
         }
+        faultMerges_.clear();
         degraded_ = anyBroken();
         if (!degraded_ && engineOpen_ && KovTestAccess::engine() != nullptr && !databaseSound()) {
             // Every table reads back, but the database's own structure is damaged (an insert
@@ -1185,6 +1573,14 @@ class StoreProgram::Impl {
     std::string lastInsertKey_;
     std::vector<std::pair<std::uint32_t, std::string>> refused_;
     FaultReport report_;
+    LoadReport loadReport_;
+    kov::engine::LoadStats loadTotals_;  // of the engines closed so far
+    kov::engine::LoadStats expect_;      // the open engine's, as the model has them
+    bool restartStats_ = false;
+    std::string stepWork_;  // the load work of the step (FaultReport::faultedLoadWork)
+    // Merges made during the step, and during the faulted steps since the last resync, by root.
+    std::map<std::uint32_t, std::map<std::string, MergeChange>> stepMerges_;
+    std::map<std::uint32_t, std::map<std::string, MergeChange>> faultMerges_;
     std::map<std::uint32_t, ModelTable> db_;
     std::vector<ModelSlot> slots_;
     std::vector<std::unique_ptr<HostTable>> tables_;
@@ -1209,6 +1605,7 @@ const std::vector<std::string>& StoreProgram::mismatchTexts() const {
 }
 std::string StoreProgram::firstMismatch() const { return impl_->firstMismatch(); }
 const FaultReport& StoreProgram::faultReport() const { return impl_->faultReport(); }
+const LoadReport& StoreProgram::loadReport() const { return impl_->loadReport(); }
 bool StoreProgram::stopped() const { return impl_->stopped(); }
 std::uint64_t StoreProgram::modelBytes() const { return impl_->modelBytes(); }
 bool StoreProgram::dirty() const { return impl_->dirty(); }

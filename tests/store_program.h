@@ -47,6 +47,7 @@
 #include <vector>
 
 #include "engine/btree.h"
+#include "engine_test_util.h"
 
 namespace kovtest {
 
@@ -132,13 +133,19 @@ struct ProgramOptions {
 
 // The options of a store fuzz target's input (tests/fuzz/store_fuzz.cpp) from its first byte:
 // bit 0 set = tables are destroyed only after their cursors (the order the store asks for);
-// bit 1 set = some records are a few KB long; bit 2 set = pager copies.
+// bit 1 set = some records are a few KB long; bit 2 set = pager copies; bit 3 set = a load
+// buffer of about 1 KiB, gathered from the second insert after a read, and three cursor actions
+// in four inserts (runs and merges within a few dozen inserts).
 inline ProgramOptions fuzzVariant(std::uint8_t variant) {
     ProgramOptions options;
     options.oddInputs = true;
     options.cursorsBeforeTables = (variant & 1) != 0;
     options.bigPercent = (variant & 2) != 0 ? 5 : 0;
     options.pagerCopies = (variant & 4) != 0;
+    if ((variant & 8) != 0) {
+        options.loads = kov::engine::test::kTinyLoads;
+        options.insertPercent = 75;
+    }
     return options;
 }
 
@@ -156,7 +163,57 @@ struct FaultReport {
     std::uint64_t damagedButReadable = 0;     // resyncs where every table read back but the
                                               // engine's consistency check failed
     std::vector<std::string> faultedActions;  // the first few faulted steps' actions
+    // What load work (see LoadReport) each of those steps did, when the model knows it: "run",
+    // "append" (a buffer appended to its table when memory ran out), "merge", space-separated;
+    // empty for none.
+    std::vector<std::string> faultedLoadWork;
+    // Loads, when a fault ended the writes: every table is compared with what the model knows
+    // was merged into it (inserted before its last read, or inserted straight); what was still
+    // gathered is lost. A table merged during the faulted step may hold any part of that merge.
+    std::uint64_t tablesAsMerged = 0;     // read back as merged, nothing more, nothing less
+    std::uint64_t tablesNotAsMerged = 0;  // read back without error, but not as merged
+    std::uint64_t tablesUncertain = 0;    // the model could not tell what was merged (below)
+    std::uint64_t entriesLostGathered = 0;  // entries lost that were still gathered
+    std::uint64_t entriesLostMerged = 0;    // merged entries missing or changed
 };
+
+// Loads (engine/btree.h): the model follows the engine's rule for every table (which inserts are
+// gathered, which buffer is written out when the load memory is full and whether it is appended
+// or becomes a run, which operations read a table and merge what it gathered) and checks the
+// engine's load statistics against it after every checked step. Summed over the run:
+struct LoadReport {
+    kov::engine::LoadStats engine;  // the engine's own, summed over the engines the program opened
+    std::uint64_t statsChecked = 0;      // steps whose load statistics matched the model's
+    std::uint64_t readsBetweenInserts = 0;   // reads of a table inserted into since its last read
+    std::uint64_t mergesByInserts = 0;       // merges of gathered entries by inserts in key order
+    std::uint64_t mergesOverEqualKeys = 0;   // merges of runs of which two hold an equal key
+    std::uint64_t createdWithPending = 0;    // tables created while entries were gathered
+    std::uint64_t resetsWithPending = 0;     // resets made while entries were gathered
+    std::uint64_t destroyedWithPending = 0;  // tables destroyed with entries gathered
+    // Buffers written out while two tables held equally many bytes: which one went first is the
+    // engine's choice, so the model stops checking the statistics, and what is merged into the
+    // tables concerned, until each of them is read.
+    std::uint64_t ambiguousSpills = 0;
+};
+
+inline void addLoads(kov::engine::LoadStats& sum, const kov::engine::LoadStats& s) {
+    sum.gathered += s.gathered;
+    sum.runsWritten += s.runsWritten;
+    sum.merges += s.merges;
+    sum.mergedByAppend += s.mergedByAppend;
+    sum.insertsAfterSearch += s.insertsAfterSearch;
+}
+inline void addLoads(LoadReport& sum, const LoadReport& r) {
+    addLoads(sum.engine, r.engine);
+    sum.statsChecked += r.statsChecked;
+    sum.readsBetweenInserts += r.readsBetweenInserts;
+    sum.mergesByInserts += r.mergesByInserts;
+    sum.mergesOverEqualKeys += r.mergesOverEqualKeys;
+    sum.createdWithPending += r.createdWithPending;
+    sum.resetsWithPending += r.resetsWithPending;
+    sum.destroyedWithPending += r.destroyedWithPending;
+    sum.ambiguousSpills += r.ambiguousSpills;
+}
 
 class StoreProgram {
   public:
@@ -184,6 +241,7 @@ class StoreProgram {
     const std::vector<std::string>& mismatchTexts() const;
     std::string firstMismatch() const;
     const FaultReport& faultReport() const;
+    const LoadReport& loadReport() const;
     bool stopped() const;
     // Bytes of data the model holds (what the store should hold).
     std::uint64_t modelBytes() const;

@@ -126,7 +126,8 @@ class FaultPlan {
 
 // One run of the soak program (tests/soak/soak.cpp), everything about it derived from its seed:
 // whether a fault is armed, its kind, mode and point, the step it is armed at, how long a
-// persistent one is held, and the program's mix. The engine's page cache is cut to `cachePages`
+// persistent one is held, the program's mix, and whether its loads are tiny (half of the runs:
+// runs written and merged within a few dozen inserts) or the engine's default. The engine's page cache is cut to `cachePages`
 // right after the engine opens, so that small records already go through the temporary file.
 struct RandomFaultRun {
     static constexpr int kSteps = 2000;
@@ -143,6 +144,7 @@ struct RandomFaultRun {
         // Resets inside a run leave stale host objects that crowd out new ones: one run in four.
         allowReset = (meta() % 4) == 0;
         wideKeys = (meta() % 2) == 0;
+        tinyLoads = (meta() % 2) == 0;
     }
 
     ProgramOptions options(int cachePages, bool trace) const {
@@ -157,6 +159,7 @@ struct RandomFaultRun {
         o.allowReset = allowReset;
         o.wideKeys = wideKeys;
         o.trace = trace;
+        o.loads = tinyLoads ? kov::engine::test::kTinyLoads : kov::engine::kDefaultLoadLimits;
         o.onEngineOpened = [cachePages] {
             kov::engine::sqlite3BtreeSetCacheSize(KovTestAccess::engine(), cachePages);
         };
@@ -172,6 +175,7 @@ struct RandomFaultRun {
     int hold;
     bool allowReset;
     bool wideKeys;
+    bool tinyLoads;
 };
 
 struct RandomFaultResult {
@@ -181,6 +185,7 @@ struct RandomFaultResult {
     bool degraded = false;
     bool writesRefused = false;  // a fault ended the write transaction (see StoreProgram)
     FaultReport report;
+    LoadReport loads;
     std::vector<std::string> mismatchTexts;
 };
 
@@ -206,6 +211,7 @@ inline RandomFaultResult runRandomFaultRun(kov::test::FaultVfs& vfs, const Rando
     result.operations = program.operations();
     result.mismatches = program.mismatches();
     result.report = program.faultReport();
+    result.loads = program.loadReport();
     result.mismatchTexts = program.mismatchTexts();
     return result;
 }

@@ -7,9 +7,10 @@
 //
 // The engine's page cache is cut to a few pages right after each engine opens (default 16 pages),
 // so that the temporary file is written and read within a few thousand small records instead of
-// the store's 64 MiB. Prints, every minute and at the end, the operations made, the faults
-// injected, what the programs found after them, and the mismatches with the model (there must be
-// none), and at the end what was found after each kind of fault (with the seeds of the first runs
+// the store's 64 MiB. Half of the runs gather their inserts in a load buffer of about 1 KiB
+// (runs written and merged within a few dozen inserts). Prints, every minute and at the end, the
+// operations made, the faults injected, what the programs found after them, what the loads did,
+// and the mismatches with the model (there must be none), and at the end what was found after each kind of fault (with the seeds of the first runs
 // that left a table broken). Exit status 0 when there was no mismatch, 1 otherwise, 2 on bad
 // arguments.
 #include <chrono>
@@ -44,6 +45,14 @@ struct Totals {
     std::uint64_t refusedStored = 0;
     std::uint64_t damagedButReadable = 0;
     std::uint64_t runsWritesRefused = 0;
+    // Loads (store_program.h, LoadReport), over the runs with tiny loads and over all.
+    std::uint64_t runsTinyLoads = 0;
+    kovtest::LoadReport loads;
+    std::uint64_t entriesLostGathered = 0;
+    std::uint64_t entriesLostMerged = 0;
+    std::uint64_t tablesAsMerged = 0;
+    std::uint64_t tablesNotAsMerged = 0;
+    std::uint64_t tablesUncertain = 0;
 };
 
 // What the runs of one fault kind found after their fault.
@@ -107,6 +116,26 @@ void print(const char* what, const Totals& t, double seconds) {
         static_cast<unsigned long long>(t.refusedStored),
         static_cast<unsigned long long>(t.damagedButReadable),
         static_cast<unsigned long long>(t.runsWritesRefused));
+    std::printf(
+        "  loads: runs with tiny loads %llu; inserts gathered %llu, runs written %llu, merges %llu "
+        "(by appending %llu, by inserts %llu, of runs sharing a key %llu); tables created, resets "
+        "and tables destroyed with entries gathered %llu; after a fault that ended the writes: "
+        "tables as merged %llu, not as merged %llu, uncertain %llu; gathered entries lost %llu, "
+        "merged entries lost %llu\n",
+        static_cast<unsigned long long>(t.runsTinyLoads),
+        static_cast<unsigned long long>(t.loads.engine.gathered),
+        static_cast<unsigned long long>(t.loads.engine.runsWritten),
+        static_cast<unsigned long long>(t.loads.engine.merges),
+        static_cast<unsigned long long>(t.loads.engine.mergedByAppend),
+        static_cast<unsigned long long>(t.loads.mergesByInserts),
+        static_cast<unsigned long long>(t.loads.mergesOverEqualKeys),
+        static_cast<unsigned long long>(t.loads.createdWithPending + t.loads.resetsWithPending +
+                                        t.loads.destroyedWithPending),
+        static_cast<unsigned long long>(t.tablesAsMerged),
+        static_cast<unsigned long long>(t.tablesNotAsMerged),
+        static_cast<unsigned long long>(t.tablesUncertain),
+        static_cast<unsigned long long>(t.entriesLostGathered),
+        static_cast<unsigned long long>(t.entriesLostMerged));
     std::fflush(stdout);
 }
 
@@ -173,6 +202,13 @@ int main(int argc, char** argv) {
         totals.refusedStored += r.refusedInsertsStored;
         totals.damagedButReadable += r.damagedButReadable;
         totals.runsWritesRefused += result.writesRefused ? 1 : 0;
+        totals.runsTinyLoads += run.tinyLoads ? 1 : 0;
+        kovtest::addLoads(totals.loads, result.loads);
+        totals.entriesLostGathered += r.entriesLostGathered;
+        totals.entriesLostMerged += r.entriesLostMerged;
+        totals.tablesAsMerged += r.tablesAsMerged;
+        totals.tablesNotAsMerged += r.tablesNotAsMerged;
+        totals.tablesUncertain += r.tablesUncertain;
         if (r.faultedSteps > 0) {
             KindTotals& k = kinds[static_cast<int>(run.kind)];
             ++k.runs;
@@ -187,10 +223,10 @@ int main(int argc, char** argv) {
                 k.brokenSeeds.push_back(runSeed);
         }
         if (result.mismatches != 0) {
-            std::printf("MISMATCH in run %llu (run seed %u, %s, armed at step %d, %s%s):\n",
+            std::printf("MISMATCH in run %llu (run seed %u, %s, armed at step %d, %s%s%s):\n",
                         static_cast<unsigned long long>(totals.runs), runSeed, result.plan.c_str(),
                         run.armAt, run.wideKeys ? "wide keys" : "narrow keys",
-                        run.allowReset ? ", resets" : "");
+                        run.allowReset ? ", resets" : "", run.tinyLoads ? ", tiny loads" : "");
             std::size_t shown = 0;
             for (const std::string& text : result.mismatchTexts) {
                 if (++shown > 3 && !replay)
