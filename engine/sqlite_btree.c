@@ -256,8 +256,9 @@ int kovsq_seek_key(KovsqCursor *cursor, const void *key, uint32_t keySize, int *
 /* Pitfall: an insert can leave BTCF_AtLast set on a cursor that no longer
  * stands on the last entry (its search started on the current page, as in
  * kovsq_seek_key), and sqlite3BtreeLast then believes it and does not move.
- * The flag is dropped after every insert; the position is kept, so that the
- * next insert through the cursor can start from it.
+ * The flag is dropped after every insert (and see the pitfall below); the
+ * position is kept, so that the next insert through the cursor can start
+ * from it.
  *
  * `at` says where the entry goes (sqlite_btree.h): searched for, next to the
  * cursor's entry as a search left it, in place of the cursor's entry, or after
@@ -296,7 +297,13 @@ static int insertPayload(KovsqCursor *cursor, const BtreePayload *payload, int a
         break;
     }
     rc = sqlite3BtreeInsert(cur, payload, flags, loc);
-    cur->curFlags &= ~BTCF_AtLast;
+    /* Pitfall: an insert before the cursor's cell (loc +1, no rebalancing)
+     * leaves the cursor on the new cell with BTCF_ValidNKey still claiming
+     * the key of the cell it stood on before; an integer search for that key
+     * through the cursor would then believe it stands on it. What the cursor
+     * believes of its cell is dropped after every insert. */
+    cur->curFlags &= ~(BTCF_AtLast | BTCF_ValidNKey | BTCF_ValidOvfl);
+    cur->info.nSize = 0;
     if (cur->eState == CURSOR_REQUIRESEEK) kovsq_clear(cursor);
     return rc;
 }

@@ -304,3 +304,28 @@ TEST(EngineLoads, InsertAfterAMissedSearchLandsInOrder) {
     EXPECT_TRUE(walkBytes(cur.get()) == modelRows(all));
     EXPECT_EQ(integrityProblems(engine.get()), "");
 }
+
+// An insert that went before the entry its search stopped on, when that entry had been read: the
+// cursor's cell is the new entry now, and a search for the old one through the same cursor must
+// find the old one (SQLite kept believing it still stood on it). Found by the soak program
+// (seed 2098357253) as data of the wrong entry read back.
+TEST(EngineLoads, SearchAfterAnInsertBeforeTheEntryASearchStoppedOn) {
+    ScopedLoadLimits loads(kStraightLoads);
+    TestEngine engine;
+    TestCursor cur(engine.get(), engine.createTable(kIntTable), 1);
+    for (std::int64_t k = 0; k < 100; k += 10)
+        ASSERT_EQ(insertInt(cur.get(), k, "k" + std::to_string(k)), SQLITE_OK);
+    ASSERT_GT(seekInt(cur.get(), 25), 0);
+    ASSERT_EQ(currentData(cur.get()), "k30");  // the cell is read: SQLite knows its key
+    ASSERT_EQ(insertInt(cur.get(), 25, "k25"), SQLITE_OK);
+    EXPECT_EQ(TEST_loadStats(engine.get()).insertsAfterSearch, 1u);
+    ASSERT_EQ(seekInt(cur.get(), 30), 0);
+    EXPECT_EQ(currentIntKey(cur.get()), 30);
+    EXPECT_EQ(currentData(cur.get()), "k30");
+    ASSERT_EQ(insertInt(cur.get(), 30, "new"), SQLITE_OK);
+    ASSERT_EQ(seekInt(cur.get(), 25), 0);
+    EXPECT_EQ(currentData(cur.get()), "k25");
+    ASSERT_EQ(seekInt(cur.get(), 30), 0);
+    EXPECT_EQ(currentData(cur.get()), "new");
+    EXPECT_EQ(integrityProblems(engine.get()), "");
+}
