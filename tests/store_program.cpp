@@ -1064,6 +1064,14 @@ class StoreProgram::Impl {
     static bool keyBefore(const ModelTable& t, const Gathered& a, const Gathered& b) {
         return t.intKey ? a.ik < b.ik : a.bk < b.bk;
     }
+    // Whether the entries arrived in strictly increasing key order (a load in key order).
+    static bool arrivedInOrder(const ModelTable& t, const std::vector<Gathered>& entries) {
+        for (std::size_t i = 1; i < entries.size(); ++i) {
+            if (!keyBefore(t, entries[i - 1], entries[i]))
+                return false;
+        }
+        return true;
+    }
     // Whether every one of `entries` lies above the B-tree's last key (an empty B-tree always).
     static bool appendsAfterMerged(const ModelTable& t, const std::vector<Gathered>& entries) {
         if (entries.empty())
@@ -1163,7 +1171,8 @@ class StoreProgram::Impl {
         }
         return n;
     }
-    // The load memory is full: the largest buffer is appended to its table, or written as a run.
+    // The load memory is full: the largest buffer is appended to its table (when it has no run and
+    // arrived in key order above the table's last key), or written as a run.
     void spillLargest() {
         std::size_t largest = 0;
         std::vector<std::uint32_t> candidates;
@@ -1188,7 +1197,8 @@ class StoreProgram::Impl {
         }
         const std::uint32_t root = candidates.front();
         ModelTable& t = db_[root];
-        if (t.load.runs == 0 && appendsAfterMerged(t, t.load.entries)) {
+        if (t.load.runs == 0 && arrivedInOrder(t, t.load.entries) &&
+            appendsAfterMerged(t, t.load.entries)) {
             stepWork_ += " append";
             ++expect_.merges;
             ++expect_.mergedByAppend;
