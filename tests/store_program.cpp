@@ -83,8 +83,8 @@ class StoreProgram::Impl {
     const FaultReport& faultReport() const { return report_; }
     const LoadReport& loadReport() {
         loadReport_.engine = loadTotals_;
-        if (engineOpen_ && KovTestAccess::engine() != nullptr)
-            addLoads(loadReport_.engine, kov::engine::TEST_loadStats(KovTestAccess::engine()));
+        if (engineOpen_ && openEngine() != nullptr)
+            addLoads(loadReport_.engine, kov::engine::TEST_loadStats(openEngine()));
         return loadReport_;
     }
     bool stopped() const { return stopped_; }
@@ -1035,8 +1035,14 @@ class StoreProgram::Impl {
 
     // The statistics of the engine about to close go into the run's sum.
     void harvestLoadStats() {
-        if (engineOpen_ && KovTestAccess::engine() != nullptr)
-            addLoads(loadTotals_, kov::engine::TEST_loadStats(KovTestAccess::engine()));
+        if (engineOpen_ && openEngine() != nullptr)
+            addLoads(loadTotals_, kov::engine::TEST_loadStats(openEngine()));
+    }
+    // The pager's engine while it is open; null otherwise (a reset through a pager copy closes
+    // the engine the pager still names).
+    static kov::engine::Btree* openEngine() {
+        kov::engine::Btree* engine = KovTestAccess::engine();
+        return kov::engine::sqlite3BtreeIsOpen(engine) ? engine : nullptr;
     }
     static std::string intKeyText(std::int64_t k) {
         std::string text(8, '\0');
@@ -1245,10 +1251,10 @@ class StoreProgram::Impl {
     }
     // After a checked step: the engine's load statistics are the model's.
     void checkLoadStats() {
-        if (!engineOpen_ || KovTestAccess::engine() == nullptr || unmodelled_ ||
-            faultSinceReset_ || writesRefused_ || anyUncertain())
+        if (!engineOpen_ || openEngine() == nullptr || unmodelled_ || faultSinceReset_ ||
+            writesRefused_ || anyUncertain())
             return;
-        const kov::engine::LoadStats got = kov::engine::TEST_loadStats(KovTestAccess::engine());
+        const kov::engine::LoadStats got = kov::engine::TEST_loadStats(openEngine());
         if (restartStats_) {
             // Uncertain no longer: follow the engine's figures from here.
             expect_ = got;
