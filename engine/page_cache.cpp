@@ -297,6 +297,11 @@ Page* makePage(Cache* c, unsigned key, int createFlag) {
         p = reinterpret_cast<Page*>(block + c->pageSize);
         p->base.pBuf = block;
         p->base.pExtra = block + c->pageSize + kHeaderSize;
+        // The bytes an unpin reads to tell an interior page start defined, for
+        // a page that SQLite hands back before it has written them.
+        block[0] = 0;
+        if (c->pageSize > 100)
+            block[100] = 0;
         if (c->purgeable && c->pages >= c->budget)
             ++gCounters.pastBudget;
     }
