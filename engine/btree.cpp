@@ -334,6 +334,17 @@ std::unique_ptr<PendingLoad> takePending(Btree* bt, Table* t) {
     return load;
 }
 
+// Merges a load (its buffer sorted) into its table's B-tree and counts the merge.
+int merge(Btree* bt, Table* t, const PendingLoad& load) {
+    bool appended = false;
+    int rc = mergeInto(bt->tree, t->root, t->shape(), load.runs, load.buffer, &appended);
+    if (rc == SQLITE_OK) {
+        ++bt->stats.merges;
+        bt->stats.mergedByAppend += appended ? 1 : 0;
+    }
+    return rc;
+}
+
 // Merges what the table has gathered into its B-tree. After a failure (now or before) what was
 // gathered is lost.
 int mergePending(Btree* bt, Table* t) {
@@ -343,12 +354,9 @@ int mergePending(Btree* bt, Table* t) {
     if (!bt->writable)
         return SQLITE_ERROR;
     load->buffer.sortUnique();
-    bool appended = false;
-    int rc = mergeInto(bt->tree, t->root, t->shape(), load->runs, load->buffer, &appended);
+    int rc = merge(bt, t, *load);
     if (rc != SQLITE_OK)
         return noteFailure(bt, rc, kInserting);
-    ++bt->stats.merges;
-    bt->stats.mergedByAppend += appended ? 1 : 0;
     releaseRuns(bt, *load, t->intKey);
     return SQLITE_OK;
 }
@@ -383,9 +391,7 @@ int spillLargest(Btree* bt) {
     if (load.runs.empty() && arrivedInOrder)
         rc = appendsToTable(bt->tree, largest->root, largest->shape(), load.buffer, &appends);
     if (rc == SQLITE_OK && appends) {
-        rc = mergeInto(bt->tree, largest->root, largest->shape(), load.runs, load.buffer, &appends);
-        ++bt->stats.merges;
-        ++bt->stats.mergedByAppend;
+        rc = merge(bt, largest, load);
     } else if (rc == SQLITE_OK) {
         std::uint32_t root = 0;
         rc = takeRunTree(bt, largest->intKey, &root);
@@ -972,18 +978,10 @@ int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, cons
             return rc;
         at = KOVSQ_SEARCH;
     }
-    // Empty data is handed on as zero bytes at a real address: SQLite copies
-    // it with memcpy, which must not be given a null pointer.
-    static const unsigned char kNothing = 0;
-    const void* data = pData != nullptr ? pData : &kNothing;
     bt->stats.insertsAfterSearch += at != KOVSQ_SEARCH ? 1 : 0;
-    int rc;
-    if (t->intKey) {
-        rc = kovsq_insert_int(pCur->cursor, nKey, data, dataSize, at);
-    } else {
-        rc = kovsq_insert_key(pCur->cursor, pKey, keySize, data, dataSize, t->hasData ? 1 : 0,
-                              at);
-    }
+    const LoadEntry entry{nKey, static_cast<const unsigned char*>(pKey), keySize,
+                          static_cast<const unsigned char*>(pData), dataSize};
+    const int rc = insertEntry(pCur->cursor, t->shape(), entry, at);
     if (isFailure(rc))
         kovsq_clear(pCur->cursor);  // SQLite may have left it faulted: on no entry, as the others
     return noteFailure(bt, rc, kInserting);

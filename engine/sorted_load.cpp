@@ -39,18 +39,6 @@ std::uint64_t orderOf(const unsigned char* key, std::uint32_t size) {
     return order;
 }
 
-// Empty data is handed on as zero bytes at a real address: SQLite copies it with memcpy, which
-// must not be given a null pointer.
-const unsigned char kNothing = 0;
-
-int insertEntry(KovsqCursor* cursor, const TableShape& shape, const LoadEntry& e, int at) {
-    const unsigned char* data = e.data != nullptr ? e.data : &kNothing;
-    if (shape.intKey)
-        return kovsq_insert_int(cursor, e.intKey, data, e.dataSize, at);
-    const unsigned char* key = e.key != nullptr ? e.key : &kNothing;
-    return kovsq_insert_key(cursor, key, e.keySize, data, e.dataSize, shape.withData ? 1 : 0, at);
-}
-
 // An SQLite cursor closed when it goes out of scope.
 struct OwnedCursor {
     KovsqCursor* cursor = nullptr;
@@ -143,6 +131,17 @@ struct Source {
 
 }  // namespace
 
+int insertEntry(KovsqCursor* cursor, const TableShape& shape, const LoadEntry& e, int at) {
+    // Empty keys and data are handed on as zero bytes at a real address: SQLite copies them with
+    // memcpy, which must not be given a null pointer.
+    static const unsigned char kNothing = 0;
+    const unsigned char* data = e.data != nullptr ? e.data : &kNothing;
+    if (shape.intKey)
+        return kovsq_insert_int(cursor, e.intKey, data, e.dataSize, at);
+    const unsigned char* key = e.key != nullptr ? e.key : &kNothing;
+    return kovsq_insert_key(cursor, key, e.keySize, data, e.dataSize, shape.withData ? 1 : 0, at);
+}
+
 int compareKeys(const TableShape& shape, const LoadEntry& a, const LoadEntry& b) {
     if (shape.intKey)
         return a.intKey < b.intKey ? -1 : (a.intKey > b.intKey ? 1 : 0);
@@ -189,8 +188,7 @@ void LoadBuffer::add(std::int64_t intKey, const void* key, std::uint32_t keySize
     bytes_ += footprint(keySize, dataSize);
     // Still strictly increasing: sortUnique has nothing to do.
     const std::size_t n = slots_.size();
-    inOrder_ = n == 1 || (inOrder_ && before(slots_[n - 2], slots_[n - 1]) &&
-                          compareKeys(TableShape{intKey_, true}, at(n - 2), at(n - 1)) != 0);
+    inOrder_ = n == 1 || (inOrder_ && compareSlots(slots_[n - 2], slots_[n - 1]) < 0);
 }
 
 LoadEntry LoadBuffer::at(std::size_t i) const {
@@ -202,23 +200,24 @@ LoadEntry LoadBuffer::at(std::size_t i) const {
                      header.dataSize};
 }
 
+int LoadBuffer::compareSlots(const Slot& a, const Slot& b) const {
+    if (a.order != b.order)
+        return a.order < b.order ? -1 : 1;
+    if (intKey_)
+        return 0;  // the order is the whole integer key
+    RecordHeader ha;
+    RecordHeader hb;
+    std::memcpy(&ha, a.record, sizeof ha);
+    std::memcpy(&hb, b.record, sizeof hb);
+    const LoadEntry ea{0, a.record + sizeof ha, ha.keySize, nullptr, 0};
+    const LoadEntry eb{0, b.record + sizeof hb, hb.keySize, nullptr, 0};
+    return compareKeys(TableShape{false, true}, ea, eb);
+}
+
 // Key order, then insertion order among equal keys.
 bool LoadBuffer::before(const Slot& a, const Slot& b) const {
-    if (a.order != b.order)
-        return a.order < b.order;
-    if (!intKey_) {
-        const TableShape shape{false, true};
-        RecordHeader ha;
-        RecordHeader hb;
-        std::memcpy(&ha, a.record, sizeof ha);
-        std::memcpy(&hb, b.record, sizeof hb);
-        const LoadEntry ea{0, a.record + sizeof ha, ha.keySize, nullptr, 0};
-        const LoadEntry eb{0, b.record + sizeof hb, hb.keySize, nullptr, 0};
-        int c = compareKeys(shape, ea, eb);
-        if (c != 0)
-            return c < 0;
-    }
-    return a.sequence < b.sequence;
+    const int c = compareSlots(a, b);
+    return c != 0 ? c < 0 : a.sequence < b.sequence;
 }
 
 void LoadBuffer::sortUnique() {
@@ -228,10 +227,9 @@ void LoadBuffer::sortUnique() {
     std::sort(slots_.begin(), slots_.end(),
               [this](const Slot& a, const Slot& b) { return before(a, b); });
     // Of each group of equal keys keep the last, the latest insert.
-    const TableShape shape{intKey_, true};
     std::size_t kept = 0;
     for (std::size_t i = 0; i < slots_.size(); ++i) {
-        if (i + 1 < slots_.size() && compareKeys(shape, at(i), at(i + 1)) == 0)
+        if (i + 1 < slots_.size() && compareSlots(slots_[i], slots_[i + 1]) == 0)
             continue;
         slots_[kept++] = slots_[i];
     }

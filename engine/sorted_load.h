@@ -50,6 +50,10 @@ struct LoadEntry {
 // then the shorter first. Negative, 0 or positive as `a` sorts before, with or after `b`.
 int compareKeys(const TableShape& shape, const LoadEntry& a, const LoadEntry& b);
 
+// Inserts one entry through an SQLite cursor on a table of that layout; `at` as in
+// sqlite_btree.h. Null key and data pointers stand for empty ones.
+int insertEntry(KovsqCursor* cursor, const TableShape& shape, const LoadEntry& e, int at);
+
 // Entries gathered in memory for one table, in the order they were inserted, until sorted.
 class LoadBuffer {
   public:
@@ -86,6 +90,9 @@ class LoadBuffer {
         std::uint32_t sequence;  // insertion order, for equal keys
     };
     unsigned char* allocate(std::size_t size);
+    // Key order alone: negative, 0 or positive.
+    int compareSlots(const Slot& a, const Slot& b) const;
+    // Key order, then insertion order among equal keys.
     bool before(const Slot& a, const Slot& b) const;
 
     bool intKey_;
