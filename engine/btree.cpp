@@ -34,10 +34,15 @@
 //  4. An inert cursor (engine closed) has bt == table == cursor == null and
 //     onEntry false; it is freed only by sqlite3BtreeCloseCursor.
 //  5. Btree::writable is false from the first failure SQLite reports until
-//     the engine is closed; every write checks it first.
+//     the engine is closed; every write checks it first. Btree::accepting is
+//     false from the first refusal for room or for the file until the engine
+//     is closed; every write the host asks for checks it first (merges of
+//     what is gathered do not: their room is reserved).
 //  6. A table with inserts gathered and not merged (Table::pending) has no
 //     cursor on an entry and no read cursor: every read merges them first.
 //  7. Btree::gathered is the sum of the bytes of every table's load buffer.
+//  8. Btree::pendingBound is the sum of loadBound over every table's pending
+//     load.
 //
 // Debug builds check these with assert (checkEngine, checkCursor) at every
 // operation that could break them; release builds compile the checks away.
@@ -58,6 +63,7 @@
 #include "engine/page_cache.h"
 #include "engine/sorted_load.h"
 #include "engine/sqlite_btree.h"
+#include "engine/temp_file.h"
 
 namespace kov::engine {
 
@@ -94,12 +100,15 @@ struct Btree {
     int openCursors = 0;
     Transaction transaction = Transaction::None;
     bool writable = true;  // false once a failure ended the write transaction
+    bool accepting = true;  // false once a write was refused for room or for the file
     int failureCode = SQLITE_OK;  // SQLite's extended code of that failure
     const char* failureOperation = "";  // what the engine was doing then
+    std::string failureDetail;  // the system's words, for a refusal
     Btree* nextOpen = nullptr;  // the list of open engines
     bool pageSizeFixed = false;
     LoadLimits limits = kDefaultLoadLimits;
     std::size_t gathered = 0;  // bytes held by the load buffers of every table
+    std::uint64_t pendingBound = 0;  // bytes the pending loads may still take in the file
     // Run B-trees: every one made (for the integrity check), and the empty ones ready for the
     // next run, by layout ([1] integer keys).
     std::vector<std::uint32_t> runTrees;
@@ -127,6 +136,33 @@ struct BtCursor {
 
 namespace {
 
+// --- Space ---
+//
+// Room in the temporary file is reserved ahead of the pages the engine holds (engine/temp_file.h,
+// engine/sqlite_btree.h), so that writing out a page the cache holds never meets a full disk:
+// a full disk refuses the write that would need more room, and loses nothing. Before each insert
+// the engine makes sure of room for every page the database holds, for what every gathered load
+// may still take when it is written out in runs and merged (its bound, below), and for the entry
+// itself. Bounds are generous; when the room for them is not there, every load is merged first
+// (it then takes what it needs, not its bound) and room asked for again. Only then is the insert
+// refused: SQLITE_FULL (or SQLITE_CANTOPEN when the file could not be made), kept as the
+// engine's failure; from then on every write the host asks for is refused, while the merges of
+// what was gathered, whose room is held, go on at the next read of their tables.
+
+// A load's bound in quarters of its entries' page bytes: a run is packed by appending (5/4, for
+// interior pages and part-filled pages); a merge into an empty table appends the same way (5/4),
+// a merge into a table that holds entries inserts, which can leave split pages half full (10/4).
+constexpr std::uint64_t kRunQuarters = 5;
+constexpr std::uint64_t kAppendQuarters = 5;
+constexpr std::uint64_t kInsertQuarters = 10;
+// Room for new tree levels and run trees, per load and per insert.
+constexpr std::uint64_t kSlackBytes = std::uint64_t{256} << 10;
+
+std::uint64_t loadBound(const PendingLoad& load) {
+    const std::uint64_t merge = load.mergeAppends ? kAppendQuarters : kInsertQuarters;
+    return (load.bufferBound * (kRunQuarters + merge) + load.runBound * merge) / 4 + kSlackBytes;
+}
+
 // Invariants 2 and 4 for one cursor.
 void checkCursor(const BtCursor* cur) {
     if (cur->bt == nullptr) {
@@ -144,6 +180,7 @@ void checkEngine(const Btree* bt) {
 #ifndef NDEBUG
     int open = 0;
     std::size_t gathered = 0;
+    std::uint64_t bound = 0;
     for (const auto& entry : bt->tables) {
         const Table* t = entry.second.get();
         assert(t->root == entry.first);
@@ -159,10 +196,12 @@ void checkEngine(const Btree* bt) {
         assert(readers == t->readCursors);
         assert(t->pending == nullptr || t->readCursors == 0);  // invariant 6
         gathered += t->pending != nullptr ? t->pending->buffer.bytes() : 0;
+        bound += t->pending != nullptr ? loadBound(*t->pending) : 0;
     }
     assert(open == bt->openCursors);
     assert(gathered == bt->gathered);  // invariant 7
-    assert(bt->writable || bt->failureCode != SQLITE_OK);
+    assert(bound == bt->pendingBound);  // invariant 8
+    assert((bt->writable && bt->accepting) || bt->failureCode != SQLITE_OK);
 #else
     (void)bt;
 #endif
@@ -186,6 +225,29 @@ int noteFailure(Btree* bt, int rc, const char* operation) {
     }
     bt->writable = false;
     return rc & 0xff;
+}
+
+// A write refused for room or because the file could not be made changed nothing: the host's
+// writes are refused from now on, and nothing is lost (the merges of what was gathered go on).
+int noteRefusal(Btree* bt, int rc, const char* operation) {
+    if (bt->failureCode == SQLITE_OK) {
+        bt->failureCode = rc;
+        bt->failureOperation = operation;
+        bt->failureDetail = lastTemporaryFileError();
+        if (bt->failureDetail.empty())
+            bt->failureDetail = (rc & 0xff) == SQLITE_CANTOPEN
+                                    ? "the temporary file could not be made"
+                                    : "no room could be reserved for the temporary file";
+    }
+    bt->accepting = false;
+    return rc & 0xff;
+}
+
+// A failed write: a refusal (kovsq_refused) or a failure.
+int noteWriteFailure(Btree* bt, int rc, const char* operation) {
+    if (isFailure(rc) && kovsq_refused(bt->tree))
+        return noteRefusal(bt, rc, operation);
+    return noteFailure(bt, rc, operation);
 }
 
 constexpr const char* kMoving = "moving a cursor";
@@ -329,10 +391,28 @@ void releaseRuns(Btree* bt, PendingLoad& load, bool intKey) {
 // Takes what the table has gathered away from it, and its buffer out of the engine's count.
 std::unique_ptr<PendingLoad> takePending(Btree* bt, Table* t) {
     std::unique_ptr<PendingLoad> load = std::move(t->pending);
-    if (load != nullptr)
+    if (load != nullptr) {
         bt->gathered -= load->buffer.bytes();
+        bt->pendingBound -= loadBound(*load);
+    }
     return load;
 }
+
+// Keeps invariant 8 while a pending load changes: its bound leaves the engine's sum when made and
+// comes back, as it is then, when destroyed.
+class BoundChange {
+  public:
+    BoundChange(Btree* bt, const PendingLoad& load) : bt_(bt), load_(load) {
+        bt_->pendingBound -= loadBound(load_);
+    }
+    ~BoundChange() { bt_->pendingBound += loadBound(load_); }
+    BoundChange(const BoundChange&) = delete;
+    BoundChange& operator=(const BoundChange&) = delete;
+
+  private:
+    Btree* bt_;
+    const PendingLoad& load_;
+};
 
 // Merges a load (its buffer sorted) into its table's B-tree and counts the merge.
 int merge(Btree* bt, Table* t, const PendingLoad& load) {
@@ -368,6 +448,31 @@ void settle(Btree* bt, Table* t) {
     mergePending(bt, t);
 }
 
+// Asks for room for every page held, every pending load's bound and `extraBytes` more.
+int reserveFor(Btree* bt, std::uint64_t extraBytes) {
+    clearTemporaryFileError();  // what the system says about this attempt, nothing older
+    KovsqSpace space{};
+    kovsq_space(bt->tree, &space);
+    const std::uint64_t grow = (bt->pendingBound + extraBytes + space.usableSize - 1) / space.usableSize;
+    const std::uint64_t need = space.pages + (grow > space.freePages ? grow - space.freePages : 0);
+    return kovsq_reserve(bt->tree, static_cast<std::int64_t>(need));
+}
+
+// Makes sure of room before a write the host asked for ("Space" above): merges every pending
+// load when the room for their bounds is not there, and refuses the write when the room is not
+// there even then.
+int ensureSpace(Btree* bt, std::uint64_t extraBytes, const char* operation) {
+    int rc = reserveFor(bt, extraBytes);
+    if (rc != SQLITE_OK && bt->pendingBound > 0) {
+        for (const auto& entry : bt->tables) {
+            if (mergePending(bt, entry.second.get()) != SQLITE_OK)
+                return SQLITE_ERROR;  // a failure, kept: writes stop
+        }
+        rc = reserveFor(bt, extraBytes);
+    }
+    return rc == SQLITE_OK ? SQLITE_OK : noteRefusal(bt, rc, operation);
+}
+
 // Makes room in the engine's load memory: the largest buffer is written out as a run.
 int spillLargest(Btree* bt) {
     Table* largest = nullptr;
@@ -380,6 +485,7 @@ int spillLargest(Btree* bt) {
     if (largest == nullptr || largest->pending->buffer.empty())
         return SQLITE_OK;
     PendingLoad& load = *largest->pending;
+    BoundChange change(bt, load);
     // A load that arrives in key order, with no run before it, goes into the table now by
     // appending when its keys all lie above the table's: it is written once, not twice. (A load
     // in random order goes into runs even when the table is empty, so that the merge can append
@@ -392,6 +498,7 @@ int spillLargest(Btree* bt) {
         rc = appendsToTable(bt->tree, largest->root, largest->shape(), load.buffer, &appends);
     if (rc == SQLITE_OK && appends) {
         rc = merge(bt, largest, load);
+        load.mergeAppends = false;  // the table holds entries now
     } else if (rc == SQLITE_OK) {
         std::uint32_t root = 0;
         rc = takeRunTree(bt, largest->intKey, &root);
@@ -400,16 +507,18 @@ int spillLargest(Btree* bt) {
             rc = writeRun(bt->tree, root, largest->shape(), load.buffer);
             ++bt->stats.runsWritten;
         }
+        load.runBound += load.bufferBound;
     }
     bt->gathered -= load.buffer.bytes();
     load.buffer.clear();
+    load.bufferBound = 0;
     return noteFailure(bt, rc, kInserting);
 }
 
 // Gathers one insert into the table's buffer, making room first when the engine's load memory is
 // full.
 int gather(Btree* bt, Table* t, const void* pKey, std::int64_t nKey, const void* pData,
-           std::uint32_t dataSize) {
+           std::uint32_t dataSize, std::uint64_t bound) {
     const std::uint32_t keySize = t->intKey ? 0 : static_cast<std::uint32_t>(nKey);
     const std::size_t need = LoadBuffer::footprint(keySize, dataSize);
     if (bt->gathered + need > bt->limits.bufferBytes) {
@@ -417,10 +526,23 @@ int gather(Btree* bt, Table* t, const void* pKey, std::int64_t nKey, const void*
         if (rc != SQLITE_OK)
             return rc;
     }
-    try {
-        if (t->pending == nullptr)
+    if (t->pending == nullptr) {
+        bool empty = false;
+        int rc = tableIsEmpty(bt->tree, t->root, t->shape(), &empty);
+        if (rc != SQLITE_OK)
+            return noteFailure(bt, rc, kInserting);
+        try {
             t->pending = std::make_unique<PendingLoad>(t->intKey);
+        } catch (const std::bad_alloc&) {
+            return noteFailure(bt, SQLITE_NOMEM, kInserting);
+        }
+        t->pending->mergeAppends = empty;
+        bt->pendingBound += loadBound(*t->pending);
+    }
+    try {
+        BoundChange change(bt, *t->pending);
         t->pending->buffer.add(nKey, pKey, keySize, pData, dataSize);
+        t->pending->bufferBound += bound;
     } catch (const std::bad_alloc&) {
         return noteFailure(bt, SQLITE_NOMEM, kInserting);
     }
@@ -476,7 +598,9 @@ int sqlite3BtreeOpen(const char* filename, sqlite3* db, Btree** ppBtree, int fla
         return SQLITE_MISUSE;
 
     auto bt = std::make_unique<Btree>();
-    installPageCache();  // before SQLite initialises: engine/page_cache.h
+    // Before SQLite initialises (engine/page_cache.h), and before the connection picks its file
+    // layer (engine/temp_file.h).
+    installTemporaryFiles();
     int rc = sqlite3_open_v2("", &bt->db, SQLITE_OPEN_READWRITE | SQLITE_OPEN_CREATE, nullptr);
     if (rc == SQLITE_OK && (flags & BTREE_OMIT_JOURNAL) != 0)
         rc = exec(bt->db, "PRAGMA journal_mode=OFF");
@@ -514,6 +638,12 @@ int sqlite3BtreeFailure(Btree* p, const char** operation) {
     if (operation != nullptr)
         *operation = p->failureOperation;
     return p->failureCode;
+}
+
+std::string sqlite3BtreeFailureDetail(Btree* p) { return p == nullptr ? "" : p->failureDetail; }
+
+bool sqlite3BtreeFailureWasRefusal(Btree* p) {
+    return p != nullptr && p->failureCode != SQLITE_OK && p->writable;
 }
 
 const char* resultText(int code) { return sqlite3_errstr(code); }
@@ -558,7 +688,11 @@ int sqlite3BtreeSetCacheSize(Btree* p, int pages) {
     if (pages < 10)
         pages = 10;
     std::string sql = "PRAGMA cache_size=" + std::to_string(pages);
-    return exec(p->db, sql.c_str());
+    int rc = exec(p->db, sql.c_str());
+    // A smaller cache can spill sooner: the file, and room in it, may be wanted now.
+    if (rc == SQLITE_OK && p->transaction == Transaction::Write && p->writable && p->accepting)
+        ensureSpace(p, 0, "changing the cache size");
+    return rc;
 }
 
 int sqlite3BtreeSetPageSize(Btree* p, int pageSize, int reserve) {
@@ -578,7 +712,7 @@ int sqlite3BtreeSetPageSize(Btree* p, int pageSize, int reserve) {
 int sqlite3BtreeBeginTrans(Btree* p, int wrflag) {
     if (p == nullptr)
         return SQLITE_MISUSE;
-    if (!p->writable)
+    if (!p->writable || !p->accepting)
         return SQLITE_ERROR;
     if (p->transaction == Transaction::Write)
         return SQLITE_OK;
@@ -610,7 +744,8 @@ int sqlite3BtreeBeginTrans(Btree* p, int wrflag) {
 int sqlite3BtreeTxnState(Btree* p) {
     if (p == nullptr || p->transaction == Transaction::None)
         return SQLITE_TXN_NONE;
-    return p->transaction == Transaction::Write && p->writable ? SQLITE_TXN_WRITE : SQLITE_TXN_READ;
+    return p->transaction == Transaction::Write && p->writable && p->accepting ? SQLITE_TXN_WRITE
+                                                                              : SQLITE_TXN_READ;
 }
 
 int sqlite3BtreeIntegrityCheck(Btree* p, int maxErrors, int* pnErr, std::string* report) {
@@ -647,7 +782,7 @@ int tableChangeRefused(Btree* p) {
     checkEngine(p);
     if (p->openCursors > 0)
         return SQLITE_LOCKED;
-    if (p->transaction != Transaction::Write || !p->writable)
+    if (p->transaction != Transaction::Write || !p->writable || !p->accepting)
         return SQLITE_ERROR;
     return SQLITE_OK;
 }
@@ -664,9 +799,10 @@ int sqlite3BtreeCreateTable(Btree* p, std::uint32_t* piTable, int flags) {
     t->intKey = (flags & BTREE_INTKEY) != 0;
     t->hasData = (flags & BTREE_ZERODATA) == 0;
     std::uint32_t root = 0;
+    clearTemporaryFileError();
     int rc = kovsq_create_table(p->tree, &root, t->intKey ? 1 : 0);
     if (rc != SQLITE_OK)
-        return noteFailure(p, rc, "creating a table");
+        return noteWriteFailure(p, rc, "creating a table");
     t->root = root;
     p->tables[root] = std::move(t);
     *piTable = root;
@@ -930,7 +1066,7 @@ int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, cons
         return SQLITE_MISUSE;
     Btree* bt = pCur->bt;
     Table* t = pCur->table;
-    if (bt->transaction != Transaction::Write || !bt->writable)
+    if (bt->transaction != Transaction::Write || !bt->writable || !bt->accepting)
         return SQLITE_ERROR;
     if (!pCur->write)
         return SQLITE_PERM;
@@ -949,6 +1085,12 @@ int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, cons
         return SQLITE_MISUSE;
     const std::uint32_t dataSize = t->hasData ? static_cast<std::uint32_t>(nData) : 0;
     const std::uint32_t keySize = t->intKey ? 0 : static_cast<std::uint32_t>(nKey);
+    // Room first: a refusal changes nothing. Enough for the entry gathered, written in a run and
+    // merged by inserts, or put straight in (with splits up to a new root).
+    const std::uint64_t bound = kovsq_entry_bound(bt->tree, t->intKey ? 1 : 0, keySize, dataSize);
+    if (int rc = ensureSpace(bt, bound * (kRunQuarters + kInsertQuarters) / 4 + kSlackBytes,
+                             kInserting))
+        return rc;
 
     // Past the first few inserts since the table was read, inserts are gathered; an entry too
     // large to gather goes straight in.
@@ -970,7 +1112,7 @@ int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, cons
         assert(c == pCur || !kovsq_valid(c->cursor));  // invariant 3
     }
     if (gathering)
-        return gather(bt, t, pKey, nKey, pData, dataSize);
+        return gather(bt, t, pKey, nKey, pData, dataSize, bound);
     if (t->pending != nullptr) {
         // What was gathered goes in first, so that this newer entry wins over an equal key.
         int rc = mergePending(bt, t);
@@ -984,7 +1126,7 @@ int sqlite3BtreeInsert(BtCursor* pCur, const void* pKey, std::int64_t nKey, cons
     const int rc = insertEntry(pCur->cursor, t->shape(), entry, at);
     if (isFailure(rc))
         kovsq_clear(pCur->cursor);  // SQLite may have left it faulted: on no entry, as the others
-    return noteFailure(bt, rc, kInserting);
+    return noteWriteFailure(bt, rc, kInserting);
 }
 
 }  // namespace kov::engine

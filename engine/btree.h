@@ -56,6 +56,19 @@
 // Threads: an engine handle and its cursors are used from one thread at a
 // time; nothing here takes a lock.
 //
+// Room in the temporary file. The file is made only in the directory of
+// temporaryDirectorySetting() (engine/temp_file.h), and room in it is
+// reserved ahead of the pages the database holds and of what gathered loads
+// may still take, so that writing out a page never meets a full disk. An
+// insert (or a table creation) for which no room can be reserved, or that
+// needs the file when it cannot be made, is refused with SQLITE_FULL (or
+// another I/O code the system gave) or SQLITE_CANTOPEN and changes nothing.
+// That refusal is kept as the engine's failure (sqlite3BtreeFailure,
+// sqlite3BtreeFailureDetail) and every later insert, table creation and drop
+// is refused with SQLITE_ERROR until the engine is closed; everything
+// inserted before reads back, gathered loads included (they are merged at the
+// next read of their table, in the room held for them).
+//
 // Refusals leave every state as it was. Failures reported by SQLite itself
 // (I/O errors, a full disk, out of memory) are returned as its result code;
 // a cursor whose step failed is left on no entry. After any such failure
@@ -128,8 +141,9 @@ using BtreeCompare = int (*)(void*, int, const void*, int, const void*);
 char*& temporaryDirectorySetting();
 
 // Opens a private temporary database on disk (no file name: the file is
-// created in the temporary directory when the cache first spills and is
-// deleted on close). `filename` must be null and `db` must be null.
+// made in the temporary directory, and only there, once the database could
+// outgrow half its cache, and is deleted on close; see "Room in the
+// temporary file" below). `filename` must be null and `db` must be null.
 // flags: BTREE_OMIT_JOURNAL = no rollback journal; BTREE_NO_READLOCK = no
 // read locks (the file is held exclusively). Writes the handle to
 // *ppBtree, or null on failure.
@@ -156,9 +170,21 @@ int sqlite3BtreeBeginTrans(Btree* p, int wrflag);
 // SQLITE_IOERR_WRITE, 778), or SQLITE_OK when there was none. *operation,
 // when not null, receives what the engine was doing then, as a phrase
 // ("inserting an entry", "moving a cursor", "reading an entry", "creating a
-// table", "dropping a table", "opening a cursor"; "" when there was none).
-// SQLITE_MISUSE for a null handle, *operation unwritten.
+// table", "dropping a table", "opening a cursor", "changing the cache size";
+// "" when there was none). SQLITE_MISUSE for a null handle, *operation
+// unwritten.
 int sqlite3BtreeFailure(Btree* p, const char** operation);
+
+// For a first failure that was a refusal for room or for the temporary file
+// (see "Room in the temporary file" below): the system's words, naming the
+// directory (for example "cannot make a file in /ro: Read-only file system").
+// Empty otherwise, and for a null handle.
+std::string sqlite3BtreeFailureDetail(Btree* p);
+
+// True when the first failure was such a refusal: it changed nothing, and
+// what tables had gathered is still merged at their next read. False
+// otherwise, and for a null handle.
+bool sqlite3BtreeFailureWasRefusal(Btree* p);
 
 // True while `p` is an engine opened by sqlite3BtreeOpen and not yet closed.
 // A handle kept elsewhere (a copy of the pager's) can outlive its engine;

@@ -270,6 +270,16 @@ int appendsToTable(KovsqTree* tree, std::uint32_t root, const TableShape& shape,
     return appendsAfterLast(table.cursor, shape, buffer.at(0), appends);
 }
 
+int tableIsEmpty(KovsqTree* tree, std::uint32_t root, const TableShape& shape, bool* empty) {
+    OwnedCursor table;
+    int rc = kovsq_cursor_open(tree, root, shape.intKey ? 1 : 0, 0, &table.cursor);
+    int none = 0;
+    if (rc == SQLITE_OK)
+        rc = kovsq_first(table.cursor, &none);
+    *empty = rc == SQLITE_OK && none != 0;
+    return rc;
+}
+
 int mergeInto(KovsqTree* tree, std::uint32_t root, const TableShape& shape,
               const std::vector<std::uint32_t>& runs, const LoadBuffer& buffer, bool* appended) {
     *appended = false;

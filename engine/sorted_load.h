@@ -109,6 +109,12 @@ struct PendingLoad {
     explicit PendingLoad(bool intKey) : buffer(intKey) {}
     LoadBuffer buffer;
     std::vector<std::uint32_t> runs;  // root pages of the run B-trees
+    // What the load may still take in the file (engine/btree.cpp, "Space"): the page bytes of its
+    // entries in the buffer and in the runs (kovsq_entry_bound), and whether its merge appends
+    // (the table was empty when the load began, and nothing went into it since).
+    std::uint64_t bufferBound = 0;
+    std::uint64_t runBound = 0;
+    bool mergeAppends = false;
 };
 
 // Writes the buffer's entries, which must be sorted and unique, into the empty B-tree `root` (of
@@ -120,6 +126,9 @@ int writeRun(KovsqTree* tree, std::uint32_t root, const TableShape& shape,
 // is then appending, and cheaper than writing a run (a load in key order).
 int appendsToTable(KovsqTree* tree, std::uint32_t root, const TableShape& shape,
                    const LoadBuffer& buffer, bool* appends);
+
+// Whether the table `root` holds no entry. An SQLite result code.
+int tableIsEmpty(KovsqTree* tree, std::uint32_t root, const TableShape& shape, bool* empty);
 
 // Merges the runs (oldest first) and the buffer (sorted and unique) into the table's B-tree
 // `root`, the newest entry winning among equal keys; *appended tells whether it appended. An

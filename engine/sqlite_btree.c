@@ -46,6 +46,14 @@
  *     sqlite3BtreeIntegrityCheck (returns the report, root page 1 included),
  *     sqlite3KeyInfoAlloc, sqlite3KeyInfoUnref, sqlite3VdbeMemInit,
  *     sqlite3PutVarint, sqlite3VarintLen, getVarint32.
+ *   Space (room reserved in the temporary file)
+ *     sqlite3BtreePager, Pager.fd, Pager.pageSize, Pager.vfsFlags,
+ *     Pager.pPCache, isOpen, pagerOpentemp (the pager's own lazy open of its
+ *     temporary file, made earlier here), numberOfCachePages,
+ *     sqlite3OsFileControl, btreePagecount, BtShared.pPage1 (the free-page
+ *     count at byte 36 of page 1, read with get4byte), BtShared.usableSize,
+ *     BtShared.maxLocal and BtShared.maxLeaf (the largest payload kept on an
+ *     index or a table leaf page without overflow).
  *
  * Behaviour relied on, found by reading 3.40.1 (see also the pitfalls noted
  * at each function):
@@ -60,6 +68,13 @@
  *   - Inserting through one cursor saves the position of every other cursor
  *     on the same tree (BTCF_Multiple): each would need a copy of its key.
  *     The binding takes those cursors off their entries first.
+ *   - The pager of a temporary database writes a page to its file only when
+ *     its cache has to make room (a fetch finds 9/10 of the cache modified and
+ *     pinned) or when it commits (never here), at offset (page - 1) * page
+ *     size, for pages up to the database's page count; it opens the file at
+ *     its first write unless it is open already. New pages come from the free
+ *     list before the database grows. An insert adds at most its overflow
+ *     pages and two pages per level of the tree plus a new root.
  *   - The B-tree layer asserts (with SQLITE_DEBUG) that a transaction is open
  *     for every cursor operation, the write transaction for writes, and that
  *     no cursor is open for create and drop. The binding's bookkeeping
@@ -79,6 +94,10 @@
  * never longer than 127 bytes) and two serial types of at most 5 bytes. */
 #define KOVSQ_MAX_HEADER 11
 
+/* The most pages one insert can add besides its overflow pages: a split on each level of a
+ * tree (two new pages at most) and a new root, for trees of up to 15 levels. */
+#define KOVSQ_SPLIT_PAGES 32
+
 /* A record buffer larger than this is given back after each insert. */
 #define KOVSQ_KEEP_BUFFER (1u << 20)
 
@@ -88,6 +107,8 @@ struct KovsqTree {
     KeyInfo *keyInfo;        /* one key field, shared by every index cursor */
     unsigned char *record;   /* the record being inserted */
     sqlite3_uint64 recordAlloc;
+    i64 reservedPages;       /* pages the temporary file has room for (0 before it exists) */
+    int refused;             /* the last call was refused for space or for the file */
 };
 
 struct KovsqCursor {
@@ -121,9 +142,95 @@ void kovsq_tree_close(KovsqTree *tree) {
     sqlite3_free(tree);
 }
 
+/* --- Space (sqlite_btree.h) --- */
+
+/* Pages a database may hold with no file at all: its cache spills a modified page only once
+ * 9/10 of the cache is modified, so half the cache keeps well clear of that. */
+static i64 pagesWithoutFile(KovsqTree *tree) {
+    Pager *pager = sqlite3BtreePager(tree->btree);
+    return numberOfCachePages(pager->pPCache) / 2;
+}
+
+/* Room asked for beyond what is needed, so that reservations are few: an eighth of what is held,
+ * at least 1 MiB and at most 64 MiB. */
+static i64 reserveStep(i64 pages, int pageSize) {
+    i64 step = pages / 8;
+    i64 least = ((i64)1 << 20) / pageSize, most = ((i64)64 << 20) / pageSize;
+    return step < least ? least : step > most ? most : step;
+}
+
+static int reserveBytes(sqlite3_file *fd, i64 pages, int pageSize) {
+    sqlite3_int64 bytes = pages * pageSize;
+    return sqlite3OsFileControl(fd, KOVSQ_FCNTL_RESERVE, &bytes);
+}
+
+int kovsq_reserve(KovsqTree *tree, int64_t pages) {
+    Pager *pager = sqlite3BtreePager(tree->btree);
+    int pageSize = (int)pager->pageSize, rc;
+    i64 target;
+    tree->refused = 0;
+    if (pages <= tree->reservedPages) return SQLITE_OK;
+    if (!isOpen(pager->fd)) {
+        if (pages <= pagesWithoutFile(tree)) return SQLITE_OK;
+        /* The pager would make its file at the first spill; it is made now, so that room is held
+         * before any page goes to it. A refusal here leaves the pager as it was. */
+        rc = pagerOpentemp(pager, pager->fd, pager->vfsFlags);
+        if (rc != SQLITE_OK) {
+            tree->refused = 1;
+            return rc;
+        }
+    }
+    target = pages + reserveStep(pages, pageSize);
+    rc = reserveBytes(pager->fd, target, pageSize);
+    if (rc != SQLITE_OK) {
+        target = pages; /* no room for the step: perhaps for what is needed */
+        rc = reserveBytes(pager->fd, target, pageSize);
+    }
+    if (rc != SQLITE_OK) {
+        tree->refused = 1;
+        return rc;
+    }
+    tree->reservedPages = target;
+    return SQLITE_OK;
+}
+
+int kovsq_refused(const KovsqTree *tree) { return tree->refused; }
+
+void kovsq_space(KovsqTree *tree, KovsqSpace *space) {
+    BtShared *bt = tree->btree->pBt;
+    space->pages = btreePagecount(bt);
+    space->freePages = bt->pPage1 != 0 ? get4byte(&bt->pPage1->aData[36]) : 0;
+    space->usableSize = bt->usableSize;
+}
+
+uint64_t kovsq_entry_bound(KovsqTree *tree, int intKey, uint32_t keySize, uint32_t dataSize) {
+    BtShared *bt = tree->btree->pBt;
+    uint64_t payload = intKey ? dataSize : (uint64_t)keySize + dataSize + KOVSQ_MAX_HEADER;
+    /* The cell's own header and pointer; past the largest local payload, a last overflow page
+     * that may be nearly empty and a 4-byte link on every overflow page. */
+    uint64_t bound = payload + 24;
+    uint64_t maxLocal = intKey ? bt->maxLeaf : bt->maxLocal;
+    if (payload > maxLocal) bound += bt->usableSize + (payload / (bt->usableSize - 4) + 1) * 4;
+    return bound;
+}
+
+/* Before an insert or a new table: room for every page held and for the most this call can add
+ * (its overflow pages, and a page split on every level up to a new root). The engine reserves
+ * more ahead of the loads it holds (btree.cpp); this is the net under every write. */
+static int guardSpace(KovsqTree *tree, sqlite3_uint64 payload) {
+    BtShared *bt = tree->btree->pBt;
+    i64 need = (i64)btreePagecount(bt) + KOVSQ_SPLIT_PAGES +
+               (i64)(payload / (bt->usableSize - 4)) + 1;
+    tree->refused = 0;
+    if (need <= tree->reservedPages) return SQLITE_OK;
+    return kovsq_reserve(tree, need);
+}
+
 int kovsq_create_table(KovsqTree *tree, uint32_t *root, int intKey) {
     Pgno page = 0;
-    int rc = sqlite3BtreeCreateTable(tree->btree, &page, intKey ? BTREE_INTKEY : BTREE_BLOBKEY);
+    int rc = guardSpace(tree, 0);
+    if (rc != SQLITE_OK) return rc;
+    rc = sqlite3BtreeCreateTable(tree->btree, &page, intKey ? BTREE_INTKEY : BTREE_BLOBKEY);
     if (rc == SQLITE_OK) *root = page;
     return rc;
 }
@@ -267,6 +374,9 @@ int kovsq_seek_key(KovsqCursor *cursor, const void *key, uint32_t keySize, int *
 static int insertPayload(KovsqCursor *cursor, const BtreePayload *payload, int at) {
     BtCursor *cur = &cursor->cur;
     int flags = 0, loc = 0, rc;
+    rc = guardSpace(cursor->tree, payload->pKey != 0 ? (sqlite3_uint64)payload->nKey
+                                                   : (sqlite3_uint64)payload->nData);
+    if (rc != SQLITE_OK) return rc;
     switch (at) {
     case KOVSQ_AT_ENTRY:
         /* The cell is parsed here so that SQLite sees the cursor on the equal

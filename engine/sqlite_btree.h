@@ -46,6 +46,37 @@ int kovsq_create_table(KovsqTree *tree, uint32_t *root, int intKey);
  * no open cursor. */
 int kovsq_drop_table(KovsqTree *tree, uint32_t root);
 
+/* Space. The temporary file holds room for the pages the database holds, reserved ahead, so that
+ * writing out a page the cache holds never meets a full disk (engine/temp_file.h). Every insert
+ * and every new table first makes sure of room for the pages held and for the most that call can
+ * add; kovsq_reserve asks for more ahead. Until the database could outgrow half its cache no
+ * page can be written out and there is no file; past that the file is made at once, in the
+ * temporary directory, and room reserved in it.
+ *
+ * A call refused for room (SQLITE_FULL, or another I/O code the system gave) or because the file
+ * could not be made (SQLITE_CANTOPEN) has changed nothing, and kovsq_refused then answers 1;
+ * every other failure answers 0 (a failure SQLite met itself, inside the call). */
+
+/* The file control that reserves room in a temporary file: its argument is an sqlite3_int64, the
+ * bytes from the start of the file that must have room. */
+#define KOVSQ_FCNTL_RESERVE 0x4b4f5601
+
+/* Makes sure of room for `pages` pages in all. */
+int kovsq_reserve(KovsqTree *tree, int64_t pages);
+/* 1 when the last insert, table creation or reservation was refused as above. */
+int kovsq_refused(const KovsqTree *tree);
+
+typedef struct KovsqSpace {
+    uint32_t pages;      /* pages in the database, free ones included */
+    uint32_t freePages;  /* pages on the free list, used before the database grows */
+    uint32_t usableSize; /* bytes of a page that hold cells */
+} KovsqSpace;
+void kovsq_space(KovsqTree *tree, KovsqSpace *space);
+
+/* The most page bytes one entry takes in a B-tree whose pages are full (keySize 0 on an
+ * integer-keyed table, dataSize 0 on a key-only one). */
+uint64_t kovsq_entry_bound(KovsqTree *tree, int intKey, uint32_t keySize, uint32_t dataSize);
+
 /* Empties a table, keeping its root page (so it can be filled again). No
  * cursor may stand on it. */
 int kovsq_clear_table(KovsqTree *tree, uint32_t root);

@@ -33,7 +33,9 @@
 // 4. The temporary directory. tempDir_ is the pager's own copy of the directory; the engine's
 //    directory setting points into its buffer from construction until teardown, and operator=
 //    on the singleton re-points it after replacing the text. Teardown sets it to null before
-//    releasing the buffer.
+//    releasing the buffer; a table made after the teardown (from a later exit-time hook) takes
+//    the process's directory again (initialize()), since the engine makes its file only in the
+//    directory the setting names, and in no other.
 //
 // 5. The store's results do not depend on engine status codes: a refusal is a silent no-op.
 //    Out-values are initialised before each engine call, so a refused call reads as "no entry".
@@ -189,6 +191,14 @@ void KovPager::closeEngine() {
 
 void KovPager::initialize() {
     closeEngine();
+    if (eng::temporaryDirectorySetting() == nullptr) {
+        // Only after the exit-time teardown, which let the directory go with the registry: a
+        // store used after it (from a later exit-time hook) takes the process's directory again,
+        // so that its file still goes there, the only place it may go.
+        const std::string dir = kov::getTempDirectory();
+        tempDir_.assign(dir.c_str());
+        eng::temporaryDirectorySetting() = tempDir_.data();
+    }
     int rc = eng::sqlite3BtreeOpen(nullptr, nullptr, &engine_,
                                    eng::BTREE_OMIT_JOURNAL | eng::BTREE_NO_READLOCK);
     // Every step is made, whatever the one before gave (the engine refuses what it cannot do
@@ -224,7 +234,13 @@ std::string KovPager::failure() const {
     text += doing;
     text += ": ";
     text += eng::resultText(code);
-    text += " (SQLite result code " + std::to_string(code) + "); temporary directory: ";
+    text += " (SQLite result code " + std::to_string(code) + ")";
+    // A refusal for room or for the temporary file says what the system said.
+    const std::string detail =
+        openFailure_ == 0 ? eng::sqlite3BtreeFailureDetail(engine_) : std::string();
+    if (!detail.empty())
+        text += ": " + detail;
+    text += "; temporary directory: ";
     text += tempDir_.empty() ? std::string("none set, the engine's default") : tempDir_;
     text += ".";
     return text;

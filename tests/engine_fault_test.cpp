@@ -27,6 +27,8 @@
 #include <vector>
 
 #include "engine/btree.h"
+#include "engine/temp_file.h"
+#include "engine_temp_dir.h"
 #include "engine_test_util.h"
 #include "fault_vfs.h"
 #include "kov_test_access.h"
@@ -307,6 +309,20 @@ void expectWritesRefused(Store& store) {
     EXPECT_FALSE(store.writable());
 }
 
+// Inserts stopped at the first failure, which refused its insert and changed nothing: every later
+// insert was refused (`failures` in all), and every table holds exactly the entries inserted
+// before the failure.
+void expectEveryEntryBeforeTheFailure(Store& store, int failures) {
+    EXPECT_EQ(failures, kRecords * kTables - store.firstFailureAt);
+    EXPECT_EQ(store.refusedAfterFirst, failures - 1);
+    std::size_t total = 0;
+    for (int t = 0; t < kTables; ++t) {
+        EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
+        total += store.model[t].size();
+    }
+    EXPECT_EQ(total, static_cast<std::size_t>(store.firstFailureAt));
+}
+
 // The failure the engine kept: its first one, with SQLite's extended code and what the engine
 // was doing. Later failures and refusals do not replace it.
 void expectFailureKept(Store& store, int code, const std::string& operation) {
@@ -350,8 +366,11 @@ void expectEverythingLost(Store& store, int faultRc) {
 }  // namespace
 
 TEST(FaultVfs, WrapsTheDefaultAndRestoresItOnDestruction) {
+    // The default, once the engine's temporary-file layer is installed, is that layer.
+    ASSERT_TRUE(kov::engine::installTemporaryFiles());
     sqlite3_vfs* before = sqlite3_vfs_find(nullptr);
     ASSERT_NE(before, nullptr);
+    EXPECT_EQ(before, sqlite3_vfs_find(kov::engine::kTemporaryFileLayer));
     {
         ScopedFaultVfs scoped;
         ASSERT_EQ(scoped.registerRc(), SQLITE_OK);
@@ -470,31 +489,72 @@ TEST(EngineFaults, WriteErrorLosesEveryTableForGood) {
     }
 }
 
-// A full disk: the same as a write error, with SQLITE_FULL. Space coming
-// back does not bring anything back; a fresh engine works.
-TEST(EngineFaults, FullDiskLosesEveryTableEvenWhenSpaceReturns) {
-    CleanRun run = measureCleanRun(false);
-    ASSERT_GT(run.bytesAfterInserts, 0u);
-    for (std::uint64_t step = 0; step < kSteps; ++step) {
-        std::uint64_t budget = run.bytesAfterInserts * step / kSteps;
-        SCOPED_TRACE("space budget " + std::to_string(budget));
-        ScopedFaultVfs scoped;
-        Store store;
-        ASSERT_TRUE(store.ready());
-        scoped.faults().setSpaceBudget(budget);
-        int failures = store.insertAll(false);
-        EXPECT_GT(scoped.faults().fullRefusals(), 0u);
-        EXPECT_LE(scoped.faults().bytesInUse(), budget);
-        EXPECT_EQ(store.firstFailureRc, SQLITE_FULL);
-        EXPECT_EQ(failures, kRecords * kTables - store.firstFailureAt);
-        EXPECT_EQ(store.refusedAfterFirst, failures - 1);
-        expectEverythingLost(store, SQLITE_FULL);
-        scoped.faults().setSpaceBudget(run.bytesAfterInserts * 4);
-        expectEverythingLost(store, SQLITE_FULL);
-        expectFailureKept(store, SQLITE_FULL, "inserting an entry");
-        EXPECT_EQ(store.close(), SQLITE_OK);
-        EXPECT_EQ(scoped.faults().bytesInUse(), 0u);
-        expectFreshEngineWorks();
+// A full disk, reached at any point of a load (straight inserts, in key order and all over the
+// tables): room is reserved ahead of every page the engine holds, so the insert that needs room
+// the disk does not have is refused with SQLITE_FULL before it changes anything, and no page
+// write ever meets the full disk. Every entry inserted before reads back in every table; every
+// later insert is refused with SQLITE_ERROR, also once space comes back; a fresh engine works.
+TEST(EngineFaults, FullDiskRefusesTheInsertThatNeedsRoomAndLosesNothing) {
+    for (bool shuffled : {false, true}) {
+        CleanRun run = measureCleanRun(shuffled);
+        ASSERT_GT(run.bytesAfterInserts, 0u);
+        for (std::uint64_t step = 0; step < kSteps; ++step) {
+            std::uint64_t budget = run.bytesAfterInserts * step / kSteps;
+            SCOPED_TRACE("space budget " + std::to_string(budget) +
+                         (shuffled ? ", shuffled" : ", in order"));
+            ScopedFaultVfs scoped;
+            Store store;
+            ASSERT_TRUE(store.ready());
+            scoped.faults().setSpaceBudget(budget);
+            int failures = store.insertAll(shuffled);
+            EXPECT_GT(scoped.faults().fullRefusals(), 0u);
+            EXPECT_LE(scoped.faults().bytesInUse(), budget);
+            EXPECT_EQ(scoped.faults().calls(FaultKind::Write) > 0,
+                      scoped.faults().bytesWritten() > 0);
+            EXPECT_EQ(store.firstFailureRc, SQLITE_FULL);
+            expectEveryEntryBeforeTheFailure(store, failures);
+            expectWritesRefused(store);
+            scoped.faults().setSpaceBudget(run.bytesAfterInserts * 4);
+            expectWritesRefused(store);
+            for (int t = 0; t < kTables; ++t)
+                EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
+            expectFailureKept(store, SQLITE_FULL, "inserting an entry");
+            EXPECT_EQ(store.close(), SQLITE_OK);
+            EXPECT_EQ(scoped.faults().bytesInUse(), 0u);
+            expectFreshEngineWorks();
+        }
+    }
+}
+
+// Reservations refused by the system (an injected fault from each point of a clean run's
+// reservations on). Refused once: the engine asks again for exactly the room it needs instead of
+// a step ahead, and goes on. Refused from then on: the insert that needed room is refused like
+// one on a full disk, and nothing is lost.
+TEST(EngineFaults, RefusedReservationsLoseNothing) {
+    CleanRun run = measureCleanRun(true);
+    const std::uint64_t reservations = run.insertCalls[static_cast<int>(FaultKind::Reserve)];
+    ASSERT_GT(reservations, 1u);
+    for (FaultMode mode : {FaultMode::Once, FaultMode::Persistent}) {
+        for (std::uint64_t n = 1; n <= reservations; ++n) {
+            SCOPED_TRACE(std::string(modeName(mode)) + " from reservation " + std::to_string(n));
+            ScopedFaultVfs scoped;
+            Store store;
+            ASSERT_TRUE(store.ready());
+            scoped.faults().failAt(FaultKind::Reserve, n, mode);
+            const int failures = store.insertAll(true);
+            EXPECT_GE(scoped.faults().injected(FaultKind::Reserve), 1u);
+            for (int t = 0; t < kTables; ++t)
+                EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
+            if (mode == FaultMode::Once) {
+                EXPECT_EQ(failures, 0);
+                EXPECT_TRUE(store.writable());
+            } else {
+                EXPECT_EQ(store.firstFailureRc, SQLITE_FULL);
+                expectWritesRefused(store);
+                expectFailureKept(store, SQLITE_FULL, "inserting an entry");
+            }
+            EXPECT_EQ(store.close(), SQLITE_OK);
+        }
     }
 }
 
@@ -508,6 +568,7 @@ void expectReadErrorDuringInsertsStopsWrites(FaultMode mode) {
     CleanRun run = measureCleanRun(true);
     std::uint64_t reads = run.insertCalls[static_cast<int>(FaultKind::Read)];
     ASSERT_GT(reads, 0u);
+    int damagedPoints = 0;
     for (std::uint64_t n : faultPoints(reads)) {
         SCOPED_TRACE(std::string(modeName(mode)) + " read fault from call " + std::to_string(n));
         ScopedFaultVfs scoped;
@@ -520,18 +581,30 @@ void expectReadErrorDuringInsertsStopsWrites(FaultMode mode) {
         EXPECT_EQ(store.refusedAfterFirst, failures - 1);
         EXPECT_EQ(scoped.faults().injected(FaultKind::Read), 1u);
         scoped.faults().clearAll();
+        // The table being written when the read failed may be damaged if the read was inside a
+        // page split (the test below); every other table holds what it was given.
+        const int written = store.firstFailureAt % kTables;
+        const bool damaged = !store.holdsModel(written);
+        damagedPoints += damaged ? 1 : 0;
         std::size_t total = 0;
         for (int t = 0; t < kTables; ++t) {
-            EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
+            if (t != written) {
+                EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
+            }
             total += store.model[t].size();
         }
         EXPECT_EQ(total, static_cast<std::size_t>(store.firstFailureAt));
         expectWritesRefused(store);
         expectFailureKept(store, SQLITE_IOERR_READ, "inserting an entry");
-        for (int t = 0; t < kTables; ++t)
-            EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
+        for (int t = 0; t < kTables; ++t) {
+            if (t != written || !damaged) {
+                EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
+            }
+        }
         EXPECT_EQ(store.close(), SQLITE_OK);
     }
+    // Most fault points fall outside a split and keep every table whole.
+    EXPECT_LT(damagedPoints, kSteps / 2);
     expectFreshEngineWorks();
 }
 
@@ -540,7 +613,8 @@ void expectReadErrorDuringInsertsStopsWrites(FaultMode mode) {
 // A failed read while inserts land all over the tables, once: the insert
 // that needed the page fails with SQLITE_IOERR and ends the write
 // transaction. The cache survives it: every table holds exactly the entries
-// inserted before, data intact. Every later insert is refused with
+// inserted before, data intact (but the one being written, when the read was
+// inside a page split: the test after the next). Every later insert is refused with
 // SQLITE_ERROR, also once the fault is gone, until the engine is closed; a
 // fresh engine works.
 TEST(EngineFaults, ReadErrorDuringInsertsKeepsEveryEarlierEntryAndStopsWrites) {
@@ -556,42 +630,53 @@ TEST(EngineFaults, PersistentReadErrorsDuringInsertsStopWritesAndLoseNothing) {
     expectReadErrorDuringInsertsStopsWrites(FaultMode::Persistent);
 }
 
-// A failed read in the middle of an insert that is splitting pages (records
-// in key order: the only reads are of pages the split needs back): the table
-// being written comes out corrupt (SQLITE_CORRUPT, nothing readable), while
-// the other tables keep every entry acknowledged before. The failure ended
-// the write transaction: every later insert is refused with SQLITE_ERROR.
+// A failed read in the middle of an insert that is splitting pages: the table being written
+// can come out damaged (entries missing, or SQLITE_CORRUPT), while the other tables keep every
+// entry acknowledged before. Read fault points over the inserts all over the tables are tried
+// until one lands inside a split. The failure ended the write transaction: every later insert is
+// refused with SQLITE_ERROR.
 TEST(EngineFaults, ReadErrorInsideAnInsertCanCorruptThatTable) {
-    CleanRun run = measureCleanRun(false);
-    ASSERT_GT(run.insertCalls[static_cast<int>(FaultKind::Read)], 0u);
-    ScopedFaultVfs scoped;
-    Store store;
-    ASSERT_TRUE(store.ready());
-    scoped.faults().failAt(FaultKind::Read, 1, FaultMode::Once);
-    int failures = store.insertAll(false);
-    ASSERT_EQ(store.firstFailureRc, SQLITE_IOERR);
-    EXPECT_EQ(failures, kRecords * kTables - store.firstFailureAt);
-    EXPECT_EQ(store.refusedAfterFirst, failures - 1);
-    EXPECT_FALSE(store.writable());
-    int failedTable = store.firstFailureAt % kTables;
-    for (int t = 0; t < kTables; ++t) {
-        Walk w = store.walk(t);
-        EXPECT_TRUE(w.bounded);
-        if (t == failedTable) {
-            EXPECT_EQ(w.rc, SQLITE_CORRUPT);
-            EXPECT_TRUE(w.records.empty());
-            EXPECT_FALSE(store.model[t].empty());
-        } else {
-            // Every acknowledged entry reads back, the ones before the failure included.
-            EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
-            EXPECT_GE(store.model[t].size(),
-                      static_cast<std::size_t>(store.firstFailureAt / kTables))
-                << "table " << t;
+    CleanRun run = measureCleanRun(true);
+    const std::uint64_t reads = run.insertCalls[static_cast<int>(FaultKind::Read)];
+    ASSERT_GT(reads, 0u);
+    const std::uint64_t stride = reads / 400 + 1;
+    bool found = false;
+    for (std::uint64_t n = 1; n <= reads && !found; n += stride) {
+        ScopedFaultVfs scoped;
+        Store store;
+        ASSERT_TRUE(store.ready());
+        scoped.faults().failAt(FaultKind::Read, n, FaultMode::Once);
+        int failures = store.insertAll(true);
+        ASSERT_EQ(store.firstFailureRc, SQLITE_IOERR);
+        scoped.faults().clearAll();
+        const int written = store.firstFailureAt % kTables;
+        if (store.holdsModel(written))
+            continue;
+        found = true;
+        SCOPED_TRACE("read fault from call " + std::to_string(n));
+        EXPECT_EQ(failures, kRecords * kTables - store.firstFailureAt);
+        EXPECT_EQ(store.refusedAfterFirst, failures - 1);
+        EXPECT_FALSE(store.writable());
+        for (int t = 0; t < kTables; ++t) {
+            Walk w = store.walk(t);
+            EXPECT_TRUE(w.bounded);
+            if (t == written) {
+                EXPECT_TRUE(w.rc == SQLITE_CORRUPT || w.records.size() < store.model[t].size())
+                    << "rc " << w.rc << ", " << w.records.size() << " of "
+                    << store.model[t].size();
+            } else {
+                // Every acknowledged entry reads back, the ones before the failure included.
+                EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
+                EXPECT_GE(store.model[t].size(),
+                          static_cast<std::size_t>(store.firstFailureAt / kTables))
+                    << "table " << t;
+            }
         }
+        expectWritesRefused(store);
+        expectFailureKept(store, SQLITE_IOERR_READ, "inserting an entry");
+        EXPECT_EQ(store.close(), SQLITE_OK);
     }
-    expectWritesRefused(store);
-    expectFailureKept(store, SQLITE_IOERR_READ, "inserting an entry");
-    EXPECT_EQ(store.close(), SQLITE_OK);
+    EXPECT_TRUE(found) << "no read fault point fell inside a page split";
     expectFreshEngineWorks();
 }
 
@@ -681,14 +766,7 @@ TEST(EngineFaults, TemporaryFileRefusedStopsWritesAndKeepsEveryEntry) {
             int failures = store.insertAll(false);
             EXPECT_EQ(scoped.faults().injected(kind), 1u);
             EXPECT_EQ(store.firstFailureRc, SQLITE_CANTOPEN);
-            EXPECT_EQ(failures, kRecords * kTables - store.firstFailureAt);
-            EXPECT_EQ(store.refusedAfterFirst, failures - 1);
-            std::size_t total = 0;
-            for (int t = 0; t < kTables; ++t) {
-                EXPECT_TRUE(store.holdsModel(t)) << "table " << t;
-                total += store.model[t].size();
-            }
-            EXPECT_EQ(total, static_cast<std::size_t>(store.firstFailureAt));
+            expectEveryEntryBeforeTheFailure(store, failures);
             scoped.faults().clearAll();
             expectWritesRefused(store);
             expectFailureKept(store, SQLITE_CANTOPEN, "inserting an entry");

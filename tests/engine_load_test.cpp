@@ -11,9 +11,12 @@
 #include <vector>
 
 #include "engine/btree.h"
+#include "engine_temp_dir.h"
 #include "engine_test_util.h"
 
 #include "engine/private_sqlite3.h"
+// after SQLite's header
+#include "fault_vfs.h"
 
 namespace {
 
@@ -328,4 +331,97 @@ TEST(EngineLoads, SearchAfterAnInsertBeforeTheEntryASearchStoppedOn) {
     ASSERT_EQ(seekInt(cur.get(), 30), 0);
     EXPECT_EQ(currentData(cur.get()), "new");
     EXPECT_EQ(integrityProblems(engine.get()), "");
+}
+
+namespace {
+
+// What a load on a nearly full disk did: where the first refusal fell and what the engine's loads
+// had done by then.
+struct FullLoad {
+    bool refused = false;
+    int firstFailureRc = SQLITE_OK;
+    LoadStats atRefusal;         // the loads' work before the refused insert
+    LoadStats afterRefusal;      // and after it (it may have merged every load to make room)
+    std::uint64_t fullRefusals = 0;
+};
+
+// Two tables loaded in random order through a 32-page cache with small runs, nothing read, until
+// the first refused insert (or 6000 inserts each), the disk modelled as `budget` bytes; then the
+// disk stays full, every table is read back and compared with the inserts that were accepted,
+// and the database is checked. Writes stay refused.
+FullLoad loadUntilFull(std::uint64_t budget) {
+    FullLoad out;
+    kov::test::ScopedFaultVfs vfs;
+    ScopedLoadLimits loads(kSmallRuns);
+    TestEngine engine;
+    sqlite3BtreeSetCacheSize(engine.get(), 32);
+    vfs.faults().setSpaceBudget(budget);
+    const std::uint32_t byteRoot = engine.createTable(kByteTable);
+    const std::uint32_t intRoot = engine.createTable(kIntTable);
+    EXPECT_NE(byteRoot, 0u);
+    EXPECT_NE(intRoot, 0u);
+    TestCursor bytes(engine.get(), byteRoot, 1);
+    TestCursor ints(engine.get(), intRoot, 1);
+    std::map<std::string, std::string> byteModel;
+    std::map<std::int64_t, std::string> intModel;
+    std::mt19937 rng(11);
+    for (int i = 0; i < 6000 && !out.refused; ++i) {
+        const std::string key = keyOf(rng() % 1000000);
+        const std::string data = patternBytes(20 + rng() % 200, static_cast<unsigned>(i));
+        const std::int64_t k = static_cast<std::int64_t>(rng() % 1000000);
+        const LoadStats before = TEST_loadStats(engine.get());
+        int rc = insertBytes(bytes.get(), key, data);
+        if (rc == SQLITE_OK) {
+            byteModel[key] = data;
+            rc = insertInt(ints.get(), k, data);
+            if (rc == SQLITE_OK)
+                intModel[k] = data;
+        }
+        if (rc != SQLITE_OK) {
+            out.refused = true;
+            out.firstFailureRc = rc;
+            out.atRefusal = before;
+            out.afterRefusal = TEST_loadStats(engine.get());
+        }
+    }
+    out.fullRefusals = vfs.faults().fullRefusals();
+    EXPECT_TRUE(walkBytes(bytes.get()) == modelRows(byteModel));
+    std::vector<std::pair<std::int64_t, std::string>> wantInts(intModel.begin(), intModel.end());
+    EXPECT_TRUE(walkInts(ints.get()) == wantInts);
+    EXPECT_EQ(integrityProblems(engine.get()), "");
+    EXPECT_LE(vfs.faults().bytesInUse(), budget);
+    if (out.refused) {
+        EXPECT_EQ(insertInt(ints.get(), -1, "after"), SQLITE_ERROR);
+        EXPECT_EQ(sqlite3BtreeTxnState(engine.get()), SQLITE_TXN_READ);
+        EXPECT_TRUE(sqlite3BtreeFailureWasRefusal(engine.get()));
+    }
+    return out;
+}
+
+}  // namespace
+
+// The disk fills while loads are gathered, written out as runs and merged, at budgets spread from
+// 256 KiB to about what the load needs: room is reserved ahead for every page held and for
+// what every gathered load may still take, so the insert that needs room the disk does not have
+// is refused (SQLITE_FULL) before it changes anything; every entry accepted before it, gathered,
+// in runs or merged, reads back, and the database is sound. Some refusals come after runs were
+// written, and some after every load was merged to make room.
+TEST(EngineLoads, FullDiskWhileRunsAreWrittenAndMergedLosesNothing) {
+    int refused = 0;
+    int withRuns = 0;
+    int afterMerging = 0;
+    for (std::uint64_t kib = 256; kib <= 8192; kib += kib / 2) {
+        SCOPED_TRACE("budget " + std::to_string(kib) + " KiB");
+        const FullLoad load = loadUntilFull(kib * 1024);
+        if (!load.refused)
+            continue;
+        ++refused;
+        EXPECT_EQ(load.firstFailureRc, SQLITE_FULL);
+        EXPECT_GT(load.fullRefusals, 0u);
+        withRuns += load.atRefusal.runsWritten > 0 ? 1 : 0;
+        afterMerging += load.afterRefusal.merges > load.atRefusal.merges ? 1 : 0;
+    }
+    EXPECT_GE(refused, 5);
+    EXPECT_GT(withRuns, 0);
+    EXPECT_GT(afterMerging, 0);
 }

@@ -24,6 +24,7 @@
 #include <vector>
 
 #include "engine/btree.h"
+#include "engine_temp_dir.h"
 #include "engine_test_util.h"
 
 namespace {

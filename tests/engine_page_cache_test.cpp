@@ -14,6 +14,7 @@
 
 #include "engine/btree.h"
 #include "engine/page_cache.h"
+#include "engine_temp_dir.h"
 #include "engine_test_util.h"
 #include "fault_vfs.h"
 

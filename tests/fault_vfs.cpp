@@ -7,8 +7,12 @@
 // write of the database goes through xRead and xWrite and is counted.
 #include "fault_vfs.h"
 
+#include <algorithm>
 #include <cstddef>
 #include <cstring>
+
+#include "engine/sqlite_btree.h"
+#include "engine/temp_file.h"
 
 namespace kov::test {
 
@@ -17,8 +21,12 @@ namespace {
 struct FaultFile {
     sqlite3_file base;
     FaultVfs* owner;
-    std::uint64_t size;  // the end of the furthest write, for the space budget
+    std::uint64_t size;      // the end of the furthest write, for the space budget
+    std::uint64_t reserved;  // bytes from the start that a reservation holds room for
     bool deleteOnClose;
+
+    // The bytes the file takes on the modelled disk.
+    std::uint64_t held() const { return std::max(size, reserved); }
 };
 
 constexpr std::size_t kRealOffset = (sizeof(FaultFile) + 7) / 8 * 8;
@@ -60,8 +68,9 @@ struct FaultVfs::Hooks {
         sqlite3_file* real = realFile(f);
         int rc = real->pMethods != nullptr ? real->pMethods->xClose(real) : SQLITE_OK;
         if (ff->deleteOnClose)
-            ff->owner->bytesInUse_ -= ff->size;
+            ff->owner->bytesInUse_ -= ff->held();
         ff->size = 0;
+        ff->reserved = 0;
         return rc;
     }
     static int read(sqlite3_file* f, void* buf, int amt, sqlite3_int64 offset) {
@@ -77,15 +86,13 @@ struct FaultVfs::Hooks {
         if (owner->take(FaultKind::Write))
             return SQLITE_IOERR_WRITE;
         std::uint64_t end = static_cast<std::uint64_t>(offset) + static_cast<std::uint64_t>(amt);
-        std::uint64_t growth = end > ff->size ? end - ff->size : 0;
-        if (owner->budgetSet_ && growth > 0 && owner->bytesInUse_ + growth > owner->budget_) {
-            ++owner->fullRefusals_;
+        std::uint64_t growth = end > ff->held() ? end - ff->held() : 0;
+        if (owner->refusesGrowth(growth))
             return SQLITE_FULL;
-        }
         sqlite3_file* real = realFile(f);
         int rc = real->pMethods->xWrite(real, buf, amt, offset);
         if (rc == SQLITE_OK) {
-            ff->size += growth;
+            ff->size = std::max(ff->size, end);
             owner->bytesInUse_ += growth;
             owner->bytesWritten_ += static_cast<std::uint64_t>(amt);
         }
@@ -98,9 +105,31 @@ struct FaultVfs::Hooks {
         sqlite3_file* real = realFile(f);
         int rc = real->pMethods->xTruncate(real, size);
         std::uint64_t newSize = static_cast<std::uint64_t>(size);
-        if (rc == SQLITE_OK && newSize < ff->size) {
-            ff->owner->bytesInUse_ -= ff->size - newSize;
-            ff->size = newSize;
+        if (rc == SQLITE_OK && newSize < ff->held()) {
+            ff->owner->bytesInUse_ -= ff->held() - newSize;
+            ff->size = std::min(ff->size, newSize);
+            ff->reserved = std::min(ff->reserved, newSize);
+        }
+        return rc;
+    }
+    // A reservation (KOVSQ_FCNTL_RESERVE) takes its growth from the space budget like a write;
+    // other file controls pass.
+    static int fileControl(sqlite3_file* f, int op, void* arg) {
+        FaultFile* ff = faultFile(f);
+        sqlite3_file* real = realFile(f);
+        if (op != KOVSQ_FCNTL_RESERVE)
+            return real->pMethods->xFileControl(real, op, arg);
+        FaultVfs* owner = ff->owner;
+        if (owner->take(FaultKind::Reserve))
+            return SQLITE_FULL;
+        const auto want = static_cast<std::uint64_t>(*static_cast<sqlite3_int64*>(arg));
+        const std::uint64_t growth = want > ff->held() ? want - ff->held() : 0;
+        if (owner->refusesGrowth(growth))
+            return SQLITE_FULL;
+        int rc = real->pMethods->xFileControl(real, op, arg);
+        if (rc == SQLITE_OK) {
+            ff->reserved = std::max(ff->reserved, want);
+            owner->bytesInUse_ += growth;
         }
         return rc;
     }
@@ -174,7 +203,7 @@ const sqlite3_io_methods FaultVfs::Hooks::methods = {
     &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xLock, int>,
     &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xUnlock, int>,
     &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xCheckReservedLock, int*>,
-    &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xFileControl, int, void*>,
+    &FaultVfs::Hooks::fileControl,
     &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xSectorSize>,
     &FaultVfs::Hooks::passToFile<&sqlite3_io_methods::xDeviceCharacteristics>,
     nullptr,
@@ -185,7 +214,7 @@ const sqlite3_io_methods FaultVfs::Hooks::methods = {
     nullptr,
 };
 
-FaultVfs::FaultVfs() : real_(sqlite3_vfs_find(nullptr)) {
+FaultVfs::FaultVfs() : real_((kov::engine::installTemporaryFiles(), sqlite3_vfs_find(nullptr))) {
     vfs_.iVersion = 2;
     vfs_.szOsFile = static_cast<int>(kRealOffset) + (real_ != nullptr ? real_->szOsFile : 0);
     vfs_.mxPathname = real_ != nullptr ? real_->mxPathname : 512;
@@ -205,6 +234,13 @@ FaultVfs::FaultVfs() : real_(sqlite3_vfs_find(nullptr)) {
     vfs_.xCurrentTime = &Hooks::passToVfs<&sqlite3_vfs::xCurrentTime, double*>;
     vfs_.xGetLastError = &Hooks::getLastError;
     vfs_.xCurrentTimeInt64 = &Hooks::currentTimeInt64;
+}
+
+bool FaultVfs::refusesGrowth(std::uint64_t growth) {
+    if (!budgetSet_ || growth == 0 || bytesInUse_ + growth <= budget_)
+        return false;
+    ++fullRefusals_;
+    return true;
 }
 
 bool FaultVfs::take(FaultKind kind) {

@@ -1,7 +1,9 @@
 // A test-only SQLite VFS that wraps the default one and injects failures.
 //
 // FaultVfs forwards every call to the VFS that was the default when it was
-// made (sqlite3_vfs_find(nullptr)) and counts the file calls by kind. It can
+// made (sqlite3_vfs_find(nullptr), after the engine's temporary-file layer
+// was installed: so that layer, engine/temp_file.h) and counts the file calls
+// by kind. It can
 // make one kind of call fail:
 //
 //   kind      counted calls                         injected result
@@ -13,6 +15,8 @@
 //   TempOpen  xOpen of a temporary file: no name,   SQLITE_CANTOPEN
 //             SQLITE_OPEN_DELETEONCLOSE, or a
 //             temporary database
+//   Reserve   a reservation of room in a file       SQLITE_FULL
+//             (the file control KOVSQ_FCNTL_RESERVE)
 //
 // failAt(kind, n, mode) arms a fault: the n-th call of that kind counted
 // from the moment it is armed (1 = the very next one) fails, and with
@@ -22,12 +26,13 @@
 // when either is due.
 //
 // Full disk: setSpaceBudget(bytes) caps the bytes held by the files opened
-// through this VFS (a file's size is the end of its furthest write, lowered
-// by truncation; a delete-on-close file gives its bytes back when closed).
-// A write that would take the total past the budget fails with SQLITE_FULL
-// and writes nothing; a write inside a file's current size always goes
-// through. Raising the budget (or clearSpaceBudget()) models space coming
-// back.
+// through this VFS (a file holds the larger of the end of its furthest write
+// and the room reserved in it, lowered by truncation; a delete-on-close file
+// gives its bytes back when closed). A write or a reservation that would take
+// the total past the budget fails with SQLITE_FULL and changes nothing; a
+// write inside what a file holds always goes through, as on a real disk
+// after a reservation. Raising the budget (or clearSpaceBudget()) models
+// space coming back.
 //
 // Counters: calls(kind) counts every call of the kind, failed ones included;
 // injected(kind) counts the failures this VFS made; fullRefusals() counts
@@ -49,8 +54,8 @@
 
 namespace kov::test {
 
-enum class FaultKind : int { Read = 0, Write, Truncate, Sync, Open, TempOpen };
-constexpr int kFaultKinds = 6;
+enum class FaultKind : int { Read = 0, Write, Truncate, Sync, Open, TempOpen, Reserve };
+constexpr int kFaultKinds = 7;
 
 enum class FaultMode { Once, Persistent };
 
@@ -97,6 +102,8 @@ class FaultVfs {
 
     // Counts one call of `kind`; true when it must fail.
     bool take(FaultKind kind);
+    // True (and counted) when `growth` more bytes would pass the space budget.
+    bool refusesGrowth(std::uint64_t growth);
 
     sqlite3_vfs vfs_{};
     sqlite3_vfs* real_ = nullptr;

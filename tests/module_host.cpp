@@ -57,7 +57,7 @@ std::vector<std::string> engineFiles(const std::string& dir) {
     std::vector<std::string> found;
     for (const std::string& target : openFiles()) {
         if (target.compare(0, dir.size() + 1, dir + "/") == 0 ||
-            target.find("etilqs_") != std::string::npos)
+            target.find("/kovpager_") != std::string::npos)
             found.push_back(target);
     }
     return found;

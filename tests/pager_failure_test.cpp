@@ -11,6 +11,7 @@
 
 #include "engine/btree.h"
 #include "pager_test_util.h"
+#include "scratch_directory.h"
 // After the engine binding's header, which shares SQLite's result-code names.
 #include "engine/private_sqlite3.h"
 
@@ -166,5 +167,35 @@ TEST_F(StoreTest, OutOfMemoryInsideTheEngine) {
     fill(keeper, 5000, 10, 10);
     EXPECT_EQ(countEntries(keeper), 1000);
     EXPECT_EQ(KovPager::instance()->failure(), first);
+    expectFreshStoreWorks();
+}
+
+// The temporary directory removed after it was chosen, before the store wanted its file: the
+// insert that wanted it is refused and the host is told why and where (on every platform); what
+// the store held reads back; after reset() a store that needs no file works.
+TEST_F(StoreTest, TemporaryDirectoryRemovedSinceItWasChosenIsTold) {
+    std::string gone;
+    {
+        kov::test::ScratchDirectory scratch("kov-gone-");
+        gone = scratch.path();
+    }
+    ASSERT_FALSE(gone.empty());
+    {
+        TempDirOverride over(gone);
+        KovPager::instance()->reset();
+        KovBtree table(KovBtree::IntKeyTable);
+        // A cache of 200 pages: the file is wanted after a few hundred records.
+        kov::engine::sqlite3BtreeSetCacheSize(KovTestAccess::engine(), 200);
+        KovBtreeCursor c(table, true);
+        const std::int64_t k = insertUntilFailed(c, 1000);
+        ASSERT_TRUE(KovPager::instance()->failed());
+        EXPECT_GT(k, 50);
+        const std::string text = KovPager::instance()->failure();
+        EXPECT_TRUE(contains(text, "while inserting an entry: unable to open database file (SQLite "
+                                   "result code 14): cannot make a file in " + gone + ": "))
+            << text;
+        EXPECT_TRUE(contains(text, "; temporary directory: " + gone + ".")) << text;
+        EXPECT_EQ(countEntries(c), k - 1);
+    }
     expectFreshStoreWorks();
 }

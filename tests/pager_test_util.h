@@ -107,6 +107,39 @@ class StoreTest : public ::testing::Test {
     void TearDown() override { EXPECT_TRUE(KovTestAccess::slots().empty()); }
 };
 
+// Inserts integer keys 0, 1, ... with `size` bytes of data until the store reports a failure (or
+// `limit` keys are in); returns how many inserts were made, the refused one included.
+inline std::int64_t insertUntilFailed(KovBtreeCursor& c, std::size_t size,
+                                      std::int64_t limit = 10000) {
+    const std::string data(size, 'd');
+    std::int64_t k = 0;
+    while (k < limit && !KovPager::instance()->failed()) {
+        c.insert(k, data.data(), data.size());
+        ++k;
+    }
+    return k;
+}
+
+// Points the store at another temporary directory (the engine reads it each time it makes its
+// file); the pager's own one comes back on destruction.
+class TempDirOverride {
+  public:
+    explicit TempDirOverride(const std::string& dir) : saved_(pagerDir()) {
+        pagerDir() = dir;
+        kov::engine::temporaryDirectorySetting() = pagerDir().data();
+    }
+    ~TempDirOverride() {
+        pagerDir() = saved_;
+        kov::engine::temporaryDirectorySetting() = pagerDir().data();
+    }
+    TempDirOverride(const TempDirOverride&) = delete;
+    TempDirOverride& operator=(const TempDirOverride&) = delete;
+
+  private:
+    static std::string& pagerDir() { return KovTestAccess::tempDir(KovPager::instance()); }
+    std::string saved_;
+};
+
 }  // namespace kovtest
 
 #endif  // KOVPAGER_TESTS_PAGER_TEST_UTIL_H

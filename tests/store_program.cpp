@@ -7,6 +7,7 @@
 #include <iterator>
 #include <map>
 #include <new>
+#include <set>
 #include <sstream>
 #include <utility>
 
@@ -45,11 +46,13 @@ class StoreProgram::Impl {
         disposeCopies();
         unmodelled_ = false;
         faultSinceReset_ = false;
+        mergesGoOn_ = false;
         KovPager::instance()->reset();
         KovTestAccess::teardown();
         engineOpen_ = false;
         restartLoads();
         db_.clear();
+        refused_.clear();
         slots_.clear();
         step_ = 0;
         dirty_ = false;
@@ -266,6 +269,7 @@ class StoreProgram::Impl {
         if (dirty_ && !armed() && !unmodelled_)
             resync();
         const std::uint64_t before = events();
+        const bool gatheredBefore = engineOpen_ && anyPendingEntries();
         pending_.clear();
         unchecked_ = false;
         lastInsertRoot_ = 0;
@@ -284,11 +288,18 @@ class StoreProgram::Impl {
             faultSinceReset_ = true;
             if (engineOpen_ && kov::engine::sqlite3BtreeIsOpen(KovTestAccess::engine()) &&
                 kov::engine::sqlite3BtreeTxnState(KovTestAccess::engine()) !=
-                    kov::engine::SQLITE_TXN_WRITE)
+                    kov::engine::SQLITE_TXN_WRITE) {
+                // A refusal for room or for the file changed nothing: what the tables gathered
+                // is still merged at their next read.
+                if (!writesRefused_)
+                    mergesGoOn_ =
+                        kov::engine::sqlite3BtreeFailureWasRefusal(KovTestAccess::engine());
                 writesRefused_ = true;
+            }
             if (lastInsertRoot_ != 0)
-                refused_.push_back({lastInsertRoot_, lastInsertKey_});
+                refused_.push_back({lastInsertRoot_, lastInsertKey_, lastHadOld_, lastOld_});
             ++report_.faultedSteps;
+            report_.faultedWithGathered += gatheredBefore ? 1 : 0;
             if (report_.faultedActions.size() < 8) {
                 report_.faultedActions.push_back(last_);
                 report_.faultedLoadWork.push_back(
@@ -642,6 +653,7 @@ class StoreProgram::Impl {
         engineOpen_ = false;
         restartLoads();
         db_.clear();
+        refused_.clear();  // of tables that are gone
         ++generation_;
         for (auto& s : slots_) {
             if (s.handle == Handle::Open)
@@ -649,6 +661,7 @@ class StoreProgram::Impl {
             s.on = false;
         }
         writesRefused_ = false;
+        mergesGoOn_ = false;
         faultSinceReset_ = false;
         if (degraded_ && !unmodelled_) {
             // The handles of a damaged engine's slots were not followed; a fresh engine starts
@@ -698,6 +711,7 @@ class StoreProgram::Impl {
             last_ = "insert int " + std::to_string(k);
             c.obj->insert(k, d.data(), d.size());
             if (allowed && t->intKey) {
+                noteReplaced(*t, k, std::string());
                 t->ints[k] = t->hasData ? d : "";
                 changed = true;
                 lastKey = intKeyText(k);
@@ -709,6 +723,7 @@ class StoreProgram::Impl {
             last_ = "insert key-only, " + std::to_string(k.size()) + " bytes";
             c.obj->insert(k.data(), k.size());
             if (allowed) {
+                noteReplaced(*t, static_cast<std::int64_t>(k.size()), k);
                 if (t->intKey)
                     t->ints[static_cast<std::int64_t>(k.size())] = "";
                 else
@@ -724,6 +739,7 @@ class StoreProgram::Impl {
                     " bytes";
             c.obj->insert(k.data(), k.size(), d.data(), d.size());
             if (allowed) {
+                noteReplaced(*t, static_cast<std::int64_t>(k.size()), k);
                 if (t->intKey)
                     t->ints[static_cast<std::int64_t>(k.size())] = t->hasData ? d : "";
                 else
@@ -738,6 +754,25 @@ class StoreProgram::Impl {
             leaveTable(s.root);
             lastInsertRoot_ = s.root;
             lastInsertKey_ = lastKey;
+        }
+    }
+
+    // What the insert about to be modelled replaces, in case a fault refuses it.
+    void noteReplaced(const ModelTable& t, std::int64_t ik, const std::string& bk) {
+        lastHadOld_ = false;
+        lastOld_.clear();
+        if (t.intKey) {
+            auto it = t.ints.find(ik);
+            if (it != t.ints.end()) {
+                lastHadOld_ = true;
+                lastOld_ = it->second;
+            }
+        } else {
+            auto it = t.bytes.find(bk);
+            if (it != t.bytes.end()) {
+                lastHadOld_ = true;
+                lastOld_ = it->second;
+            }
         }
     }
 
@@ -1142,7 +1177,7 @@ class StoreProgram::Impl {
     void mergeLoad(std::uint32_t root, ModelTable& t) {
         if (!t.load.pending)
             return;
-        if (writesRefused_) {
+        if (writesRefused_ && !mergesGoOn_) {
             clearLoad(t);  // the engine refuses writes: what was gathered is lost
             return;
         }
@@ -1453,11 +1488,11 @@ class StoreProgram::Impl {
         if (cur != nullptr)
             eng::sqlite3BtreeCloseCursor(cur);
         truth.broken = rc != kEngineOk;
-        if (classify && writesRefused_) {
+        if (classify && writesRefused_ && !mergesGoOn_) {
             std::vector<std::string> refused;
             for (const auto& r : refused_) {
-                if (r.first == root)
-                    refused.push_back(r.second);
+                if (r.root == root)
+                    refused.push_back(r.key);
             }
             if (t.load.uncertain)
                 ++report_.tablesUncertain;
@@ -1471,22 +1506,23 @@ class StoreProgram::Impl {
             std::uint64_t lost = 0;
             std::uint64_t extra = 0;
             // The inserts that a fault refused: the model took them, the store should not have.
-            for (const auto& r : refused_) {
-                if (r.first != root)
+            // Newest first, so that each one that did not happen gives the model back what the
+            // one before it left.
+            std::set<std::string> settled;
+            for (auto r = refused_.rbegin(); r != refused_.rend(); ++r) {
+                if (r->root != root || settled.count(r->key) != 0)
                     continue;
-                bool present;
+                int outcome;
                 if (t.intKey) {
                     std::int64_t k = 0;
-                    std::memcpy(&k, r.second.data(), 8);
-                    present = truth.ints.count(k) != 0;
-                    if (!present)
-                        t.ints.erase(k);
+                    std::memcpy(&k, r->key.data(), 8);
+                    outcome = resolveRefused(t.ints, truth.ints, k, *r);
                 } else {
-                    present = truth.bytes.count(r.second) != 0;
-                    if (!present)
-                        t.bytes.erase(r.second);
+                    outcome = resolveRefused(t.bytes, truth.bytes, r->key, *r);
                 }
-                ++(present ? report_.refusedInsertsStored : report_.refusedInsertsDropped);
+                if (outcome >= 0)
+                    settled.insert(r->key);
+                ++(outcome > 0 ? report_.refusedInsertsStored : report_.refusedInsertsDropped);
             }
             if (t.intKey) {
                 for (const auto& e : t.ints) {
@@ -1518,11 +1554,38 @@ class StoreProgram::Impl {
         t = std::move(truth);
     }
 
+    // Inserts that a fault met: the table, the key as the model holds it, and what it replaced.
+    struct Refused {
+        std::uint32_t root;
+        std::string key;
+        bool hadOld;
+        std::string old;
+    };
+
+    // An insert a fault met. 1: the store holds what the model took (the insert was stored, or a
+    // later one settled the key). Otherwise the model goes back to what the insert replaced (or
+    // to no entry): 0 when that is what the store holds, -1 when an older insert must tell.
+    template <typename Map, typename Key>
+    static int resolveRefused(Map& model, const Map& truth, const Key& key, const Refused& r) {
+        auto now = truth.find(key);
+        auto took = model.find(key);
+        if (now != truth.end() && took != model.end() && now->second == took->second)
+            return 1;
+        if (r.hadOld)
+            model[key] = r.old;
+        else
+            model.erase(key);
+        took = model.find(key);
+        const bool same = now == truth.end() ? took == model.end()
+                                             : took != model.end() && took->second == now->second;
+        return same ? 0 : -1;
+    }
+
     void resync() {
         ++report_.resyncs;
         dirty_ = false;
         struct Clear {
-            std::vector<std::pair<std::uint32_t, std::string>>& v;
+            std::vector<Refused>& v;
             ~Clear() { v.clear(); }
         } clearRefused{refused_};
         if (engineOpen_ && KovTestAccess::engine() != nullptr) {
@@ -1579,6 +1642,8 @@ class StoreProgram::Impl {
     bool unmodelled_ = false;  // the model stopped following the store (pager copies)
     bool faultSinceReset_ = false;
     bool writesRefused_ = false;
+    // Writes were refused for room or for the file (nothing lost): merges go on.
+    bool mergesGoOn_ = false;
     bool unchecked_ = false;
     bool stopped_ = false;
     std::uint64_t mismatches_ = 0;
@@ -1587,7 +1652,9 @@ class StoreProgram::Impl {
     long long lastSlot_ = -1;
     std::uint32_t lastInsertRoot_ = 0;
     std::string lastInsertKey_;
-    std::vector<std::pair<std::uint32_t, std::string>> refused_;
+    bool lastHadOld_ = false;  // what the last insert replaced (noteReplaced)
+    std::string lastOld_;
+    std::vector<Refused> refused_;
     FaultReport report_;
     LoadReport loadReport_;
     kov::engine::LoadStats loadTotals_;  // of the engines closed so far

@@ -152,6 +152,7 @@ inline ProgramOptions fuzzVariant(std::uint8_t variant) {
 // What a resync found in each model table, summed over the run.
 struct FaultReport {
     std::uint64_t faultedSteps = 0;    // steps during which a fault was injected
+    std::uint64_t faultedWithGathered = 0;  // of those, steps begun with entries gathered
     std::uint64_t resyncs = 0;         // times the model was set from the engine
     std::uint64_t tablesIntact = 0;    // read back exactly as the model had them
     std::uint64_t tablesLostSome = 0;  // read back without error, some acknowledged entries missing

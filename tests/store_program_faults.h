@@ -31,7 +31,7 @@ namespace kovtest {
 
 class FaultPlan {
   public:
-    enum class Kind { Read, Write, TempOpen, FullDisk };
+    enum class Kind { Read, Write, TempOpen, FullDisk, Reserve };
 
     FaultPlan(kov::test::FaultVfs& vfs, Kind kind, std::uint64_t n, kov::test::FaultMode mode,
               int holdSteps)
@@ -45,6 +45,8 @@ class FaultPlan {
                 return "write";
             case Kind::TempOpen:
                 return "temporary-file open";
+            case Kind::Reserve:
+                return "reservation";
             default:
                 return "full disk";
         }
@@ -79,6 +81,9 @@ class FaultPlan {
                 break;
             case Kind::FullDisk:
                 vfs_.setSpaceBudget(n_);
+                break;
+            case Kind::Reserve:
+                vfs_.failAt(kov::test::FaultKind::Reserve, n_, mode_);
                 break;
         }
     }
