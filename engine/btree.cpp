@@ -438,6 +438,11 @@ int mergePending(Btree* bt, Table* t) {
     if (rc != SQLITE_OK)
         return noteFailure(bt, rc, kInserting);
     releaseRuns(bt, *load, t->intKey);
+    // The room held for this load's bound is spent: what is still wanted is the other loads'.
+    KovsqSpace space{};
+    kovsq_space(bt->tree, &space);
+    kovsq_release(bt->tree, static_cast<std::int64_t>(
+                                space.pages + (bt->pendingBound + kSlackBytes) / space.usableSize + 1));
     return SQLITE_OK;
 }
 

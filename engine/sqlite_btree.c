@@ -196,6 +196,22 @@ int kovsq_reserve(KovsqTree *tree, int64_t pages) {
 
 int kovsq_refused(const KovsqTree *tree) { return tree->refused; }
 
+void kovsq_release(KovsqTree *tree, int64_t pages) {
+    Pager *pager = sqlite3BtreePager(tree->btree);
+    int pageSize = (int)pager->pageSize;
+    i64 keep;
+    sqlite3_int64 bytes;
+    if (!isOpen(pager->fd)) return;
+    if (pages < (i64)btreePagecount(tree->btree->pBt)) pages = btreePagecount(tree->btree->pBt);
+    keep = pages + reserveStep(pages, pageSize);
+    /* Only room worth a second step: a merge and the next load do not give room back and take
+     * it again each time. */
+    if (tree->reservedPages <= keep + reserveStep(pages, pageSize)) return;
+    bytes = keep * pageSize;
+    if (sqlite3OsFileControl(pager->fd, KOVSQ_FCNTL_RELEASE, &bytes) == SQLITE_OK)
+        tree->reservedPages = keep;
+}
+
 void kovsq_space(KovsqTree *tree, KovsqSpace *space) {
     BtShared *bt = tree->btree->pBt;
     space->pages = btreePagecount(bt);

@@ -66,6 +66,15 @@ int kovsq_reserve(KovsqTree *tree, int64_t pages);
 /* 1 when the last insert, table creation or reservation was refused as above. */
 int kovsq_refused(const KovsqTree *tree);
 
+/* The file control that gives back room past an sqlite3_int64 byte count, which must be at least
+ * the end of every page the database holds. */
+#define KOVSQ_FCNTL_RELEASE 0x4b4f5602
+
+/* Gives back the room held past `pages` pages (the pages held and what is still wanted) and a
+ * step, when that is more than another step: once a load is merged, the room held for its bound
+ * is spent. Nothing happens when the file does not exist or the system refuses. */
+void kovsq_release(KovsqTree *tree, int64_t pages);
+
 typedef struct KovsqSpace {
     uint32_t pages;      /* pages in the database, free ones included */
     uint32_t freePages;  /* pages on the free list, used before the database grows */

@@ -107,6 +107,17 @@ int fileControl(sqlite3_file* file, int op, void* arg) {
             f->reserved = want;
         return noted(rc, error);
     }
+    if (op == KOVSQ_FCNTL_RELEASE) {
+        TempFile* f = of(file);
+        const std::int64_t keep = *static_cast<sqlite3_int64*>(arg);
+        if (keep >= f->reserved)
+            return SQLITE_OK;
+        std::string error;
+        int rc = os::release(f->handle, keep, &error);
+        if (rc == SQLITE_OK)
+            f->reserved = keep;
+        return noted(rc, error);
+    }
     // The pager's own size hints are not needed: the engine reserves ahead of them.
     if (op == SQLITE_FCNTL_SIZE_HINT)
         return SQLITE_OK;

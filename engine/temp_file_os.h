@@ -35,6 +35,10 @@ int writeAt(Handle file, const void* buffer, int amount, std::int64_t offset, st
 // SQLITE_OK, SQLITE_FULL, or SQLITE_IOERR_WRITE.
 int reserve(Handle file, std::int64_t from, std::int64_t to, std::string* error);
 
+// Gives back the room held past `keep` bytes (nothing the file holds lies there).
+// SQLITE_OK or SQLITE_IOERR_TRUNCATE.
+int release(Handle file, std::int64_t keep, std::string* error);
+
 // SQLITE_OK or SQLITE_IOERR_FSTAT.
 int size(Handle file, std::int64_t* out, std::string* error);
 

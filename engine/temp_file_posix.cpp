@@ -100,6 +100,15 @@ int reserve(Handle file, std::int64_t from, std::int64_t to, std::string* error)
                     "cannot reserve space for the temporary file", err, error);
 }
 
+int release(Handle file, std::int64_t keep, std::string* error) {
+    // The room was taken by making the file longer: shortening it gives the blocks back.
+    std::int64_t now = 0;
+    int rc = size(file, &now, error);
+    if (rc != SQLITE_OK || now <= keep)
+        return rc == SQLITE_OK ? SQLITE_OK : SQLITE_IOERR_TRUNCATE;
+    return truncate(file, keep, error);
+}
+
 int size(Handle file, std::int64_t* out, std::string* error) {
     struct stat st {};
     if (::fstat(static_cast<int>(file), &st) != 0)

@@ -158,7 +158,8 @@ int writeAt(Handle file, const void* buffer, int amount, std::int64_t offset, st
     return SQLITE_OK;
 }
 
-int reserve(Handle file, std::int64_t from, std::int64_t to, std::string* error) {
+// (An allocation size counts from the start of the file: `from` is not needed.)
+int reserve(Handle file, std::int64_t /*from*/, std::int64_t to, std::string* error) {
     // The allocation size holds room past the end of the file without moving the end (data
     // written there later needs no zero-filling first).
     FILE_ALLOCATION_INFO info{};
@@ -180,6 +181,18 @@ int reserve(Handle file, std::int64_t from, std::int64_t to, std::string* error)
     }
     return failWith(isFull(err) ? SQLITE_FULL : SQLITE_IOERR_WRITE,
                     "cannot reserve space for the temporary file", err, error);
+}
+
+int release(Handle file, std::int64_t keep, std::string* error) {
+    // An allocation size past the end gives its room back when set lower; an end moved out to
+    // hold room (the fallback above) is moved back.
+    LARGE_INTEGER end{};
+    if (::GetFileSizeEx(handleOf(file), &end) && end.QuadPart > keep)
+        return truncate(file, keep, error);
+    FILE_ALLOCATION_INFO info{};
+    info.AllocationSize.QuadPart = keep;
+    ::SetFileInformationByHandle(handleOf(file), FileAllocationInfo, &info, sizeof info);
+    return SQLITE_OK;
 }
 
 int size(Handle file, std::int64_t* out, std::string* error) {

@@ -112,11 +112,22 @@ struct FaultVfs::Hooks {
         }
         return rc;
     }
-    // A reservation (KOVSQ_FCNTL_RESERVE) takes its growth from the space budget like a write;
-    // other file controls pass.
+    // A reservation (KOVSQ_FCNTL_RESERVE) takes its growth from the space budget like a write, and
+    // a release (KOVSQ_FCNTL_RELEASE) gives it back; other file controls pass.
     static int fileControl(sqlite3_file* f, int op, void* arg) {
         FaultFile* ff = faultFile(f);
         sqlite3_file* real = realFile(f);
+        if (op == KOVSQ_FCNTL_RELEASE) {
+            // Room given back: the file holds less.
+            int rc = real->pMethods->xFileControl(real, op, arg);
+            const auto keep = static_cast<std::uint64_t>(*static_cast<sqlite3_int64*>(arg));
+            if (rc == SQLITE_OK && keep < ff->reserved) {
+                const std::uint64_t before = ff->held();
+                ff->reserved = std::max(keep, ff->size);
+                ff->owner->bytesInUse_ -= before - ff->held();
+            }
+            return rc;
+        }
         if (op != KOVSQ_FCNTL_RESERVE)
             return real->pMethods->xFileControl(real, op, arg);
         FaultVfs* owner = ff->owner;
