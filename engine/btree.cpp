@@ -129,7 +129,8 @@ struct BtCursor {
     std::int64_t seekIntKey = 0;
     std::string seekKey;
     KovsqEntry entry{};
-    std::string keyCopy;  // a key that does not lie whole on its page
+    std::string keyCopy;   // a key that does not lie whole on its page
+    std::string dataCopy;  // data that does not lie whole on its page
     BtCursor* prev = nullptr;  // neighbours on the table's list
     BtCursor* next = nullptr;
 };
@@ -1027,6 +1028,23 @@ int sqlite3BtreeKey(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, voi
     return copyPayload(pCur, pCur->entry.keyOffset + offset, amt, pBuf);
 }
 
+namespace {
+
+// Payload bytes [offset, offset+size) of the current entry in place, or, when they run onto
+// overflow pages, a copy in `copy` (the cursor's, valid until it is used again). Null when the
+// copy could not be read.
+const void* payloadInPlace(BtCursor* cur, std::uint32_t offset, std::uint32_t size,
+                           std::string& copy) {
+    if (std::uint64_t{offset} + size <= cur->entry.localSize)
+        return cur->entry.local + offset;
+    copy.resize(size);
+    if (copyPayload(cur, offset, size, copy.data()) != SQLITE_OK)
+        return nullptr;
+    return copy.data();
+}
+
+}  // namespace
+
 const void* sqlite3BtreeKeyFetch(BtCursor* pCur, std::uint32_t* pAmt) {
     if (pCur == nullptr || pAmt == nullptr)
         return nullptr;
@@ -1034,16 +1052,23 @@ const void* sqlite3BtreeKeyFetch(BtCursor* pCur, std::uint32_t* pAmt) {
     if (!pCur->onEntry || pCur->table->intKey || describe(pCur) != SQLITE_OK)
         return nullptr;
     const KovsqEntry& e = pCur->entry;
-    const unsigned char* key = e.local + e.keyOffset;
-    if (std::uint64_t{e.keyOffset} + e.keySize > e.localSize) {
-        // The key runs onto overflow pages: lend a copy instead.
-        pCur->keyCopy.resize(e.keySize);
-        if (copyPayload(pCur, e.keyOffset, e.keySize, pCur->keyCopy.data()) != SQLITE_OK)
-            return nullptr;
-        key = reinterpret_cast<const unsigned char*>(pCur->keyCopy.data());
-    }
-    *pAmt = e.keySize;
+    const void* key = payloadInPlace(pCur, e.keyOffset, e.keySize, pCur->keyCopy);
+    if (key != nullptr)
+        *pAmt = e.keySize;
     return key;
+}
+
+const void* sqlite3BtreeDataFetch(BtCursor* pCur, std::uint32_t* pAmt) {
+    if (pCur == nullptr || pAmt == nullptr)
+        return nullptr;
+    *pAmt = 0;
+    if (!pCur->onEntry || describe(pCur) != SQLITE_OK)
+        return nullptr;
+    const KovsqEntry& e = pCur->entry;
+    const void* data = payloadInPlace(pCur, e.keyOffset + e.keySize, e.dataSize, pCur->dataCopy);
+    if (data != nullptr)
+        *pAmt = e.dataSize;
+    return data;
 }
 
 int sqlite3BtreeDataSize(BtCursor* pCur, std::uint32_t* pSize) {

@@ -251,6 +251,12 @@ int sqlite3BtreeKey(BtCursor* pCur, std::uint32_t offset, std::uint32_t amt, voi
 // null with *pAmt untouched for a null handle.
 const void* sqlite3BtreeKeyFetch(BtCursor* pCur, std::uint32_t* pAmt);
 
+// The current entry's data bytes in place, as sqlite3BtreeKeyFetch hands out
+// its key (a copy held by the cursor when the data runs onto overflow pages):
+// valid until the cursor moves or its table changes. Null (and *pAmt 0) on no
+// entry; a non-null pointer with *pAmt 0 for empty data.
+const void* sqlite3BtreeDataFetch(BtCursor* pCur, std::uint32_t* pAmt);
+
 // The data's length in bytes; 0 on no entry.
 int sqlite3BtreeDataSize(BtCursor* pCur, std::uint32_t* pSize);
 

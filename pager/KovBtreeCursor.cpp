@@ -148,6 +148,22 @@ bool KovBtreeCursor::indexKeySeek(const void* key, std::uint64_t size) {
 // for. On no entry (or with no engine cursor) the key reads as empty. A cursor opened on an
 // IntKeyTable, or standing on an integer key (a cursor kept over a reset may have been reopened
 // on such a table), has no key bytes and fetches nothing.
+std::string_view KovBtreeCursor::keyView() {
+    std::uint32_t length = 0;
+    const unsigned char* key = currentKey(length);
+    if (key == nullptr)
+        return {};
+    return {reinterpret_cast<const char*>(key), length};
+}
+
+std::string_view KovBtreeCursor::dataView() {
+    std::uint32_t length = 0;
+    const void* data = eng::sqlite3BtreeDataFetch(handle(), &length);
+    if (data == nullptr)
+        return {};
+    return {static_cast<const char*>(data), length};
+}
+
 const unsigned char* KovBtreeCursor::currentKey(std::uint32_t& length) {
     length = 0;
     if (slotIndex_ < registry_->size() &&

@@ -6,6 +6,7 @@
 #include <cstdio>
 #include <memory>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include "pager_test_util.h"
@@ -240,6 +241,38 @@ TYPED_TEST(CursorSuite, DataReadsBackAsInserted) {
             EXPECT_EQ(c.dataSize(), 0);
         }
     }
+}
+
+// The views read the same bytes as the copying members: the key's bytes (none for integer
+// keys), the data's (none on key-only tables), also for data long enough to run onto overflow
+// pages; both empty on no entry.
+TYPED_TEST(CursorSuite, ViewsReadTheEntryInPlace) {
+    KovBtreeCursor c(*this->table, true);
+    const std::string big(9000, 'b');
+    for (int i = 0; i < 40; ++i)
+        TypeParam::put(c, i, i % 7 == 3 ? big + std::to_string(i) : "d" + std::to_string(i));
+    EXPECT_TRUE(c.keyView().empty());
+    EXPECT_TRUE(c.dataView().empty());
+    int seen = 0;
+    for (bool on = c.first(); on; on = c.next()) {
+        const std::string_view key = c.keyView();
+        const std::string_view data = c.dataView();
+        if (TypeParam::kType == KovBtree::IntKeyTable) {
+            EXPECT_TRUE(key.empty());
+        } else {
+            EXPECT_EQ(std::string(key), byteKey(c));
+        }
+        if (TypeParam::kHasData) {
+            EXPECT_EQ(std::string(data), dataOf(c));
+            EXPECT_EQ(data.size(), static_cast<std::size_t>(c.dataSize()));
+        } else {
+            EXPECT_TRUE(data.empty());
+        }
+        ++seen;
+    }
+    EXPECT_EQ(seen, 40);
+    EXPECT_TRUE(c.keyView().empty());  // past the end
+    EXPECT_TRUE(c.dataView().empty());
 }
 
 TYPED_TEST(CursorSuite, CursorsKeepTheirEntriesWhenTablesAreCreated) {

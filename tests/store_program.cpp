@@ -9,6 +9,7 @@
 #include <new>
 #include <set>
 #include <sstream>
+#include <string_view>
 #include <utility>
 
 #include "engine/btree.h"
@@ -885,6 +886,12 @@ class StoreProgram::Impl {
         buf.assign(data.size() + 1, '#');
         c.obj->data(&buf[0], data.size() + 1);  // one byte too many: nothing
         expectTrue(buf == std::string(data.size() + 1, '#'), "data past the end");
+        // The same bytes in place: the data, and the key of a byte-string entry (none for an
+        // integer key, and none on no entry).
+        expectTrue(c.obj->dataView() == data, "data view");
+        const bool byteKeyed = t != nullptr && !t->intKey && s.on;
+        expectTrue(c.obj->keyView() == (byteKeyed ? std::string_view(s.bk) : std::string_view()),
+                   "key view");
         if (t != nullptr && !t->intKey && s.on) {
             std::string whole = s.bk + data;
             std::size_t n = static_cast<std::size_t>(pick(static_cast<int>(whole.size()) + 2));

@@ -38,6 +38,7 @@
 
 #include <cstdint>
 #include <string>
+#include <string_view>
 #include <vector>
 
 #include <kovpager/KovBtree.h>
@@ -109,6 +110,17 @@ class KOVPAGER_EXPORT KovBtreeCursor {
 
     // The current entry's data length in bytes; 0 on no entry and on key-only tables.
     std::int64_t dataSize();
+
+    // The current entry's key bytes and data bytes where they lie in the store's memory, without
+    // a copy. A view stays valid until this cursor moves or is destroyed, any insert into its
+    // table (through any cursor), the construction of any KovBtree (which closes and reopens every
+    // cursor) or KovPager::reset(), whichever comes first: copy what must live longer. Both are
+    // empty on no entry; keyView() is empty on an IntKeyTable (its keys are numbers: key() reads
+    // them), dataView() on an IndexTable. The copying members above read the same bytes.
+    //   for (bool on = c.first(); on; on = c.next())
+    //       use(c.keyView(), c.dataView());
+    std::string_view keyView();
+    std::string_view dataView();
 
     // Moves to the smallest entry whose key is not less than `key` (usually a prefix) and returns
     // true; false, on no entry, when every key is smaller. True says nothing about whether the
