@@ -1,11 +1,14 @@
 // A minimal host: one integer-keyed table, a writing cursor, a second table
-// created while the cursor is open, then a walk that checks every record.
+// created while the cursor is open, then a walk that checks every record; then
+// the same store through the C++17 face (<kovpager/kovpager.hpp>).
 #include <kovpager/KovBtree.h>
 #include <kovpager/KovBtreeCursor.h>
 #include <kovpager/KovPager.h>
+#include <kovpager/kovpager.hpp>
 
 #include <cstdint>
 #include <cstdio>
+#include <optional>
 #include <string>
 
 int main() {
@@ -39,5 +42,19 @@ int main() {
         return 1;
     }
     std::printf("consumer: %lld records stored and read back\n", static_cast<long long>(seen));
+
+    kovpager::BytesTable users;
+    users.put("alice", "admin");
+    users.put("albert", "guest");
+    users.put("bob", "guest");
+    int prefixed = 0;
+    for (const auto& e : users.with_prefix("al"))
+        prefixed += e.key().substr(0, 2) == "al" ? 1 : 0;
+    if (users.get("alice") != std::optional<std::string>("admin") || users.get("carol") ||
+        prefixed != 2 || kovpager::failed()) {
+        std::fprintf(stderr, "consumer: the face reads back wrong\n");
+        return 1;
+    }
+    std::printf("consumer: the face reads back\n");
     return 0;
 }
