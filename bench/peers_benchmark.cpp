@@ -68,6 +68,7 @@
 #include "bench/bench_util.h"
 #include "bench/peers_map.h"
 #include "bench/peers_raw.h"
+#include "bench/peers_face.h"
 #include "bench/peers_store.h"
 #include "bench/peers_workloads.h"
 #if defined(KOV_PEERS_HAVE_LMDB)
@@ -344,7 +345,7 @@ Result runOn(const std::string& workload, std::uint64_t n, const std::string& sc
 }
 
 const char* const kBackends[] = {
-    "store",   "sqlite", "map",
+    "store",   "face",   "sqlite", "map",
 #if defined(KOV_PEERS_HAVE_LMDB)
     "lmdb",
 #endif
@@ -357,6 +358,9 @@ Result run(const std::string& backend, const std::string& workload, std::uint64_
            const std::string& scratch) {
     if (backend == "store") {
         return runOn<kov::peers::StoreBackend>(workload, n, scratch);
+    }
+    if (backend == "face") {
+        return runOn<kov::peers::FaceBackend>(workload, n, scratch);
     }
     if (backend == "sqlite") {
         return runOn<kov::peers::RawBackend>(workload, n, scratch);
