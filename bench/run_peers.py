@@ -45,7 +45,7 @@ WORKLOADS = {
           "each a lookup of the key's 8-byte count and a write of count + 1)",
 }
 ORDER = ["W1", "W2", "W3", "W4", "W5", "W6", "W6i", "W7"]
-BACKEND_ORDER = ["store", "sqlite", "map", "lmdb", "rocksdb"]
+BACKEND_ORDER = ["store", "face", "sqlite", "map", "lmdb", "rocksdb"]
 # Per-operation fields of a phase, recorded for the fill phase too (fill_<field>).
 SPLIT_FIELDS = ["ns_user", "ns_sys", "reads_per_op", "writes_per_op", "read_bytes_per_op",
                 "write_bytes_per_op"]
@@ -53,6 +53,9 @@ SETTINGS = {
     "store": "KovBtree / KovBtreeCursor on the library's own SQLite B-trees; one writing cursor "
              "per table; temporary file in KOV_TEMP; W7: seek, data() of the 8-byte count when "
              "found, insert of count + 1 on a BlobTable",
+    "face": "the store through <kovpager/kovpager.hpp>: one table object; walks by range-for "
+            "reading key() and data() in place, seeks by get() (a std::string copy of the "
+            "data); W7: get, then put",
     "sqlite": "hand-written SQL through the system's SQLite (Debian's libsqlite3): temporary "
               "database (empty name), page_size 4096, cache_size 16384 "
               "(64 MiB), journal_mode OFF, locking_mode EXCLUSIVE, synchronous OFF, one BEGIN "
@@ -68,6 +71,15 @@ SETTINGS = {
     "rocksdb": "64 MiB LRU block cache, default write buffer (64 MiB) and background jobs, WAL "
                "disabled, no sync; integer keys as 8 big-endian bytes; W7: Get, then Put",
 }
+
+
+def paired_ratios(a_rows, b_rows, a, b, field="ns_cpu"):
+    """a time / b time (`field`: processor or elapsed ns) for every repetition in which both
+    ran."""
+    pairs = {}
+    for r in a_rows + b_rows:
+        pairs.setdefault((r.get("invocation", ""), r.get("rep", 0)), {})[r["backend"]] = r
+    return [p[a][field] / p[b][field] for p in pairs.values() if a in p and b in p]
 
 
 def run_one(program, backend, workload, n, scratch):
@@ -102,7 +114,10 @@ def measure(args, program, out_path):
     tree = source_tree()
     with open(out_path, "a") as out:
         for n, w, names in plan:
-            paired = [b for b in ("store", "sqlite") if b in names]
+            # The store and raw SQLite run back to back in every repetition, their order flipping;
+            # so do the face, the store's copying members and LMDB when the face is measured.
+            pairs = ("store", "sqlite", "face", "lmdb") if "face" in names else ("store", "sqlite")
+            paired = [b for b in pairs if b in names]
             others = [b for b in names if b not in paired]
             for rep in range(max(args.reps, args.peer_reps)):
                 order = []
@@ -327,12 +342,8 @@ def render(args, rows, results_md, chart_png, command):
             bs = best[(w, n, "store")]
             bq = best[(w, n, "sqlite")]
             ratio = bs["ns_cpu"] / bq["ns_cpu"]
-            pairs = {}
-            for r in s + q:
-                pairs.setdefault((r.get("invocation", ""), r.get("rep", 0)), {})[r["backend"]] = r
-            pairs = [p for p in pairs.values() if "store" in p and "sqlite" in p]
-            paired = [p["store"]["ns_cpu"] / p["sqlite"]["ns_cpu"] for p in pairs]
-            wall = [p["store"]["ns_wall"] / p["sqlite"]["ns_wall"] for p in pairs]
+            paired = paired_ratios(s, q, "store", "sqlite")
+            wall = paired_ratios(s, q, "store", "sqlite", "ns_wall")
             cells += [f"**{statistics.median(paired):.2f}**" if paired else "-", f"{ratio:.2f}",
                       f"{statistics.median(wall):.2f}" if wall else "-"]
         headline.append([w] + cells)
@@ -361,6 +372,32 @@ def render(args, rows, results_md, chart_png, command):
         lambda w, n, b: fmt_ns(min(r["ns_wall"] for r in by[(w, n, b)])) if (w, n, b) in by
         else "-")
     L.append("")
+
+    # The face against LMDB and against the store's copying members, paired.
+    face_pairs = [(a, b) for a, b in (("face", "lmdb"), ("face", "store"))
+                  if any((w, n, a) in by and (w, n, b) in by for w in workloads for n in ns)]
+    if face_pairs:
+        L.append("## The face (<kovpager/kovpager.hpp>) against LMDB and the copying members")
+        L.append("")
+        L.append("Paired medians of face time / other time (processor time), each ratio taken "
+                 "within one repetition where the two ran back to back: at or below 1 the face "
+                 "is as fast or faster.")
+        L.append("")
+        face_ns = [n for n in ns if any((w, n, "face") in by for w in workloads)]
+        cells = []
+        for w in workloads:
+            row = [w]
+            for n in face_ns:
+                for a, b in face_pairs:
+                    ratios = paired_ratios(by.get((w, n, a), []), by.get((w, n, b), []), a, b)
+                    row.append(f"**{statistics.median(ratios):.2f}**" if ratios else "-")
+            if any(c != "-" for c in row[1:]):
+                cells.append(row)
+        names = {"lmdb": "LMDB", "store": "copying"}
+        L += md_table(["workload"] + [f"N={fmt_n(n)} / {names[b]}" for n in face_ns
+                                      for _, b in face_pairs],
+                      ["---"] + ["---:"] * (len(face_ns) * len(face_pairs)), cells)
+        L.append("")
 
     # The store against LMDB and RocksDB.
     peers = [b for b in ("lmdb", "rocksdb") if b in backends]
@@ -494,7 +531,8 @@ def chart(best, ns, backends, workloads, chart_png, args):
         "set logscale xy", "set grid", "set key top left font ',8'",
         "set xlabel 'N'", "set ylabel 'ns/op'", "set format x '10^{%L}'",
     ]
-    styles = {"store": "lw 3 lc rgb '#d62728' pt 7", "sqlite": "lw 2 lc rgb '#1f77b4' pt 5",
+    styles = {"store": "lw 3 lc rgb '#d62728' pt 7", "face": "lw 2 lc rgb '#ff7f0e' pt 7 dt 3",
+              "sqlite": "lw 2 lc rgb '#1f77b4' pt 5",
               "map": "lw 1 lc rgb '#7f7f7f' pt 9 dt 2", "lmdb": "lw 2 lc rgb '#2ca02c' pt 11",
               "rocksdb": "lw 2 lc rgb '#9467bd' pt 13"}
     for w in workloads:
