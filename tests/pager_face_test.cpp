@@ -221,3 +221,136 @@ TEST_F(Face, PutDuringAWalkStopsDebugBuilds) {
         },
         "put\\(\\) while a walk of the table is alive");
 }
+
+namespace {
+
+// One table of a random program, with its model.
+struct ModelledTable {
+    int kind = 0;  // 0 integer keys, 1 byte keys with data, 2 byte keys alone
+    std::unique_ptr<kovpager::IntTable> ints;
+    std::unique_ptr<kovpager::BytesTable> bytes;
+    std::unique_ptr<kovpager::IndexTable> keys;
+    std::map<std::int64_t, std::string> intModel;
+    std::map<std::string, std::string> byteModel;
+
+    explicit ModelledTable(int k) : kind(k) {
+        if (kind == 0)
+            ints = std::make_unique<kovpager::IntTable>();
+        else if (kind == 1)
+            bytes = std::make_unique<kovpager::BytesTable>();
+        else
+            keys = std::make_unique<kovpager::IndexTable>();
+    }
+
+    template <typename Table>
+    static std::vector<std::pair<std::string, std::string>> rows(Table& t) {
+        std::vector<std::pair<std::string, std::string>> out;
+        for (const auto& e : t)
+            out.emplace_back(std::string(e.key()), std::string(e.data()));
+        return out;
+    }
+};
+
+}  // namespace
+
+// Random programs over several tables of the three kinds at once: tables made and destroyed
+// (cursors of the others closed and reopened each time), puts, gets and contains, whole walks,
+// lower_bound walks and prefix walks, resets; every answer checked against the models.
+TEST_F(Face, RandomProgramsOverSeveralTablesMatchTheModels) {
+    for (std::uint32_t seed = 1; seed <= 40; ++seed) {
+        SCOPED_TRACE("seed " + std::to_string(seed));
+        std::mt19937 rng(seed);
+        std::vector<std::unique_ptr<ModelledTable>> tables;
+        for (int step = 0; step < 400; ++step) {
+            const unsigned op = rng() % 100;
+            if (tables.empty() || (op < 6 && tables.size() < 4)) {
+                tables.push_back(std::make_unique<ModelledTable>(static_cast<int>(rng() % 3)));
+                continue;
+            }
+            ModelledTable& t = *tables[rng() % tables.size()];
+            if (op < 9) {
+                tables.erase(tables.begin() + static_cast<std::ptrdiff_t>(rng() % tables.size()));
+            } else if (op < 10) {
+                tables.clear();  // a host lets its tables go, then starts over
+                kovpager::reset();
+            } else if (op < 60) {
+                if (t.kind == 0) {
+                    const std::int64_t k = static_cast<std::int64_t>(rng() % 300) - 150;
+                    const std::string d = randomBytes(rng, 12);
+                    t.ints->put(k, d);
+                    t.intModel[k] = d;
+                } else {
+                    const std::string k = randomBytes(rng, 5);
+                    const std::string d = t.kind == 1 ? randomBytes(rng, 12) : std::string();
+                    if (t.kind == 1)
+                        t.bytes->put(k, d);
+                    else
+                        t.keys->put(k);
+                    t.byteModel[k] = d;
+                }
+            } else if (op < 80) {
+                if (t.kind == 0) {
+                    const std::int64_t k = static_cast<std::int64_t>(rng() % 300) - 150;
+                    const auto it = t.intModel.find(k);
+                    ASSERT_EQ(t.ints->get(k), it == t.intModel.end()
+                                                  ? std::nullopt
+                                                  : std::optional<std::string>(it->second));
+                } else {
+                    const std::string k = randomBytes(rng, 5);
+                    const auto it = t.byteModel.find(k);
+                    if (t.kind == 1) {
+                        ASSERT_EQ(t.bytes->get(k), it == t.byteModel.end()
+                                                       ? std::nullopt
+                                                       : std::optional<std::string>(it->second));
+                    } else {
+                        ASSERT_EQ(t.keys->contains(k), it != t.byteModel.end());
+                    }
+                }
+            } else if (op < 90) {
+                if (t.kind == 0) {
+                    std::vector<std::pair<std::int64_t, std::string>> got;
+                    for (const auto& e : *t.ints)
+                        got.emplace_back(e.key(), std::string(e.data()));
+                    ASSERT_EQ(got, (std::vector<std::pair<std::int64_t, std::string>>(
+                                       t.intModel.begin(), t.intModel.end())));
+                } else {
+                    ASSERT_EQ(t.kind == 1 ? ModelledTable::rows(*t.bytes)
+                                          : ModelledTable::rows(*t.keys),
+                              (std::vector<std::pair<std::string, std::string>>(
+                                  t.byteModel.begin(), t.byteModel.end())));
+                }
+            } else if (t.kind == 0) {
+                // The first few entries from a key on.
+                const std::int64_t from = static_cast<std::int64_t>(rng() % 320) - 160;
+                auto want = t.intModel.lower_bound(from);
+                int n = 0;
+                for (const auto& e : t.ints->lower_bound(from)) {
+                    ASSERT_NE(want, t.intModel.end());
+                    ASSERT_EQ(e.key(), want->first);
+                    ASSERT_EQ(e.data(), want->second);
+                    ++want;
+                    if (++n == 5)
+                        break;
+                }
+                if (n < 5) {
+                    ASSERT_EQ(want, t.intModel.end());
+                }
+            } else {
+                const std::string prefix = randomBytes(rng, 2);
+                auto want = t.byteModel.lower_bound(prefix);
+                auto walk = t.kind == 1 ? t.bytes->with_prefix(prefix) : t.keys->with_prefix(prefix);
+                for (const auto& e : walk) {
+                    ASSERT_NE(want, t.byteModel.end());
+                    ASSERT_EQ(std::string(e.key()), want->first);
+                    ASSERT_EQ(std::string(e.data()), want->second);
+                    ++want;
+                }
+                ASSERT_TRUE(want == t.byteModel.end() ||
+                            want->first.compare(0, prefix.size(), prefix) != 0);
+            }
+        }
+        ASSERT_FALSE(kovpager::failed()) << kovpager::failure();
+        tables.clear();
+        kovpager::reset();
+    }
+}
