@@ -415,6 +415,17 @@ class BoundChange {
     const PendingLoad& load_;
 };
 
+// The pages the file must have room for: every page held, and what the pending loads' bounds
+// and `extraBytes` more may add beyond the free pages (which new pages take first).
+std::int64_t pagesWanted(const Btree* bt, std::uint64_t extraBytes) {
+    KovsqSpace space{};
+    kovsq_space(bt->tree, &space);
+    const std::uint64_t grow =
+        (bt->pendingBound + extraBytes + space.usableSize - 1) / space.usableSize;
+    return static_cast<std::int64_t>(space.pages +
+                                     (grow > space.freePages ? grow - space.freePages : 0));
+}
+
 // Merges a load (its buffer sorted) into its table's B-tree and counts the merge.
 int merge(Btree* bt, Table* t, const PendingLoad& load) {
     bool appended = false;
@@ -440,10 +451,7 @@ int mergePending(Btree* bt, Table* t) {
         return noteFailure(bt, rc, kInserting);
     releaseRuns(bt, *load, t->intKey);
     // The room held for this load's bound is spent: what is still wanted is the other loads'.
-    KovsqSpace space{};
-    kovsq_space(bt->tree, &space);
-    kovsq_release(bt->tree, static_cast<std::int64_t>(
-                                space.pages + (bt->pendingBound + kSlackBytes) / space.usableSize + 1));
+    kovsq_release(bt->tree, pagesWanted(bt, kSlackBytes));
     return SQLITE_OK;
 }
 
@@ -457,11 +465,7 @@ void settle(Btree* bt, Table* t) {
 // Asks for room for every page held, every pending load's bound and `extraBytes` more.
 int reserveFor(Btree* bt, std::uint64_t extraBytes) {
     clearTemporaryFileError();  // what the system says about this attempt, nothing older
-    KovsqSpace space{};
-    kovsq_space(bt->tree, &space);
-    const std::uint64_t grow = (bt->pendingBound + extraBytes + space.usableSize - 1) / space.usableSize;
-    const std::uint64_t need = space.pages + (grow > space.freePages ? grow - space.freePages : 0);
-    return kovsq_reserve(bt->tree, static_cast<std::int64_t>(need));
+    return kovsq_reserve(bt->tree, pagesWanted(bt, extraBytes));
 }
 
 // Makes sure of room before a write the host asked for ("Space" above): merges every pending

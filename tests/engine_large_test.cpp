@@ -16,6 +16,7 @@
 #include <vector>
 
 #include "engine/btree.h"
+#include "engine_temp_dir.h"
 #include "engine_test_util.h"
 #include "host_util.h"
 #include "scratch_directory.h"
@@ -78,24 +79,6 @@ bool haveProcFd() {
 bool endsWith(const std::string& s, const std::string& tail) {
     return s.size() >= tail.size() && s.compare(s.size() - tail.size(), tail.size(), tail) == 0;
 }
-
-// Points the engine's temporary-directory setting at a buffer for the
-// lifetime of this object, then restores the previous setting.
-class TempDirSetting {
-  public:
-    explicit TempDirSetting(const std::string& dir) : buffer_(dir.begin(), dir.end()) {
-        buffer_.push_back('\0');
-        previous_ = temporaryDirectorySetting();
-        temporaryDirectorySetting() = buffer_.data();
-    }
-    ~TempDirSetting() { temporaryDirectorySetting() = previous_; }
-    TempDirSetting(const TempDirSetting&) = delete;
-    TempDirSetting& operator=(const TempDirSetting&) = delete;
-
-  private:
-    std::vector<char> buffer_;
-    char* previous_ = nullptr;
-};
 
 TEST(EngineLarge, RunPastTheCacheSpillsIntoTheTemporaryDirectoryAndReadsBack) {
     const kov::test::ScratchDirectory scratch("kovpager-engine-large-");

@@ -2,7 +2,8 @@
 // (engine/temp_file.h), which the pager sets before it opens its engine. A test program that
 // drives the engine without a pager includes this header: before its first test the setting
 // names a scratch directory of the program's own (unless something set it already), and after
-// its last test the setting is cleared and the directory removed.
+// its last test the setting is cleared and the directory removed. TempDirSetting points it
+// elsewhere for a while.
 #ifndef KOVPAGER_TESTS_ENGINE_TEMP_DIR_H
 #define KOVPAGER_TESTS_ENGINE_TEMP_DIR_H
 
@@ -15,6 +16,23 @@
 #include "scratch_directory.h"
 
 namespace kov::engine::test {
+
+// Points the engine's temporary-directory setting at its own copy of `dir` for as long as it
+// lives, then restores the previous setting.
+class TempDirSetting {
+  public:
+    explicit TempDirSetting(const std::string& dir)
+        : text_(dir), previous_(temporaryDirectorySetting()) {
+        temporaryDirectorySetting() = text_.data();
+    }
+    ~TempDirSetting() { temporaryDirectorySetting() = previous_; }
+    TempDirSetting(const TempDirSetting&) = delete;
+    TempDirSetting& operator=(const TempDirSetting&) = delete;
+
+  private:
+    std::string text_;
+    char* previous_;
+};
 
 class TemporaryDirectoryEnvironment : public ::testing::Environment {
   public:

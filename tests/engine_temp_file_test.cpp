@@ -13,28 +13,14 @@
 #include "engine/private_sqlite3.h"
 #include "engine/sqlite_btree.h"
 #include "engine/temp_file.h"
+#include "engine_temp_dir.h"
 #include "host_util.h"
 #include "scratch_directory.h"
 
 namespace {
 
 using kov::engine::temporaryDirectorySetting;
-
-// Points the engine's setting at a directory for as long as it lives.
-class DirectorySetting {
-  public:
-    explicit DirectorySetting(const std::string& dir)
-        : text_(dir), previous_(temporaryDirectorySetting()) {
-        temporaryDirectorySetting() = text_.data();
-    }
-    ~DirectorySetting() { temporaryDirectorySetting() = previous_; }
-    DirectorySetting(const DirectorySetting&) = delete;
-    DirectorySetting& operator=(const DirectorySetting&) = delete;
-
-  private:
-    std::string text_;
-    char* previous_;
-};
+using kov::engine::test::TempDirSetting;
 
 // A file of the layer, opened as SQLite opens a temporary database.
 class LayerFile {
@@ -97,7 +83,7 @@ TEST(TemporaryFiles, NoDirectoryChosenRefusesTheFile) {
 TEST(TemporaryFiles, FileIsMadeInTheChosenDirectoryAndReservesRoom) {
     kov::test::ScratchDirectory scratch("kov-layer-");
     ASSERT_FALSE(scratch.path().empty());
-    DirectorySetting setting(scratch.path());
+    TempDirSetting setting(scratch.path());
     {
         LayerFile f;
         ASSERT_EQ(f.rc, SQLITE_OK);
@@ -133,13 +119,9 @@ TEST(TemporaryFiles, FileIsMadeInTheChosenDirectoryAndReservesRoom) {
 // A directory removed since it was chosen: the file is refused, and the message names the
 // directory.
 TEST(TemporaryFiles, MissingDirectoryRefusesTheFileAndSaysWhere) {
-    std::string gone;
-    {
-        kov::test::ScratchDirectory scratch("kov-layer-gone-");
-        gone = scratch.path();
-    }
+    const std::string gone = kov::test::vanishedDirectory("kov-layer-gone-");
     ASSERT_FALSE(gone.empty());
-    DirectorySetting setting(gone);
+    TempDirSetting setting(gone);
     LayerFile f;
     EXPECT_EQ(f.rc, SQLITE_CANTOPEN);
     EXPECT_EQ(f.methods(), nullptr);

@@ -241,14 +241,6 @@ struct ModelledTable {
         else
             keys = std::make_unique<kovpager::IndexTable>();
     }
-
-    template <typename Table>
-    static std::vector<std::pair<std::string, std::string>> rows(Table& t) {
-        std::vector<std::pair<std::string, std::string>> out;
-        for (const auto& e : t)
-            out.emplace_back(std::string(e.key()), std::string(e.data()));
-        return out;
-    }
 };
 
 }  // namespace
@@ -314,8 +306,7 @@ TEST_F(Face, RandomProgramsOverSeveralTablesMatchTheModels) {
                     ASSERT_EQ(got, (std::vector<std::pair<std::int64_t, std::string>>(
                                        t.intModel.begin(), t.intModel.end())));
                 } else {
-                    ASSERT_EQ(t.kind == 1 ? ModelledTable::rows(*t.bytes)
-                                          : ModelledTable::rows(*t.keys),
+                    ASSERT_EQ(t.kind == 1 ? walkAll(*t.bytes) : walkAll(*t.keys),
                               (std::vector<std::pair<std::string, std::string>>(
                                   t.byteModel.begin(), t.byteModel.end())));
                 }

@@ -19,10 +19,6 @@ using namespace kovtest;
 
 namespace {
 
-bool contains(const std::string& text, const std::string& part) {
-    return text.find(part) != std::string::npos;
-}
-
 // A cap on the memory of the library's SQLite, lifted on destruction.
 class HeapCap {
   public:
@@ -174,11 +170,7 @@ TEST_F(StoreTest, OutOfMemoryInsideTheEngine) {
 // insert that wanted it is refused and the host is told why and where (on every platform); what
 // the store held reads back; after reset() a store that needs no file works.
 TEST_F(StoreTest, TemporaryDirectoryRemovedSinceItWasChosenIsTold) {
-    std::string gone;
-    {
-        kov::test::ScratchDirectory scratch("kov-gone-");
-        gone = scratch.path();
-    }
+    const std::string gone = kov::test::vanishedDirectory("kov-gone-");
     ASSERT_FALSE(gone.empty());
     {
         TempDirOverride over(gone);

@@ -24,10 +24,6 @@ using namespace kovtest;
 
 namespace {
 
-bool contains(const std::string& text, const std::string& part) {
-    return text.find(part) != std::string::npos;
-}
-
 // The process's open descriptors: number and target.
 std::vector<std::pair<std::string, std::string>> openFiles() {
     std::vector<std::pair<std::string, std::string>> files;

@@ -107,6 +107,10 @@ class StoreTest : public ::testing::Test {
     void TearDown() override { EXPECT_TRUE(KovTestAccess::slots().empty()); }
 };
 
+inline bool contains(const std::string& text, const std::string& part) {
+    return text.find(part) != std::string::npos;
+}
+
 // Inserts integer keys 0, 1, ... with `size` bytes of data until the store reports a failure (or
 // `limit` keys are in); returns how many inserts were made, the refused one included.
 inline std::int64_t insertUntilFailed(KovBtreeCursor& c, std::size_t size,

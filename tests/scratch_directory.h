@@ -49,6 +49,12 @@ class ScratchDirectory {
     std::string path_;
 };
 
+// The path of a directory that existed a moment ago and exists no more (made and removed at
+// once): a temporary directory removed since it was chosen. Empty when none could be made.
+inline std::string vanishedDirectory(const std::string& prefix) {
+    return ScratchDirectory(prefix).path();
+}
+
 }  // namespace kov::test
 
 #endif  // KOVPAGER_TESTS_SCRATCH_DIRECTORY_H

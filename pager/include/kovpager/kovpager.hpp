@@ -50,7 +50,6 @@
 #include <optional>
 #include <string>
 #include <string_view>
-#include <type_traits>
 #include <utility>
 
 #include <kovpager/KovBtree.h>
@@ -69,66 +68,10 @@ inline void reset() { KovPager::instance()->reset(); }
 
 namespace detail {
 
-// What the three tables share: the table, a writing cursor for put(), get() and contains(), and
-// the count of live walks (for the debug checks above).
-class TableBase {
-  public:
-    TableBase(TableBase&&) noexcept = default;
-    TableBase& operator=(TableBase&& other) noexcept {
-        if (this != &other) {
-            assertNoWalks();
-            cursor_.reset();  // before its table
-            table_.reset();
-            walks_ = std::move(other.walks_);
-            table_ = std::move(other.table_);
-            cursor_ = std::move(other.cursor_);
-        }
-        return *this;
-    }
-    TableBase(const TableBase&) = delete;
-    TableBase& operator=(const TableBase&) = delete;
-    ~TableBase() {
-        assertNoWalks();
-        cursor_.reset();  // before its table
-    }
-
-  protected:
-    explicit TableBase(KovBtree::TableType type)
-        : walks_(std::make_shared<std::size_t>(0)),
-          table_(std::make_unique<KovBtree>(type)),
-          cursor_(std::make_unique<KovBtreeCursor>(*table_, true)) {}
-
-    // The writing cursor; null for a moved-from table.
-    KovBtreeCursor* writer() {
-        assert(cursor_ != nullptr && "a moved-from table");
-        return cursor_.get();
-    }
-    void beforePut() const {
-        assert(walks_ == nullptr || *walks_ == 0 || !"put() while a walk of the table is alive");
-    }
-    // A cursor for a new walk, counted; null for a moved-from table.
-    std::unique_ptr<KovBtreeCursor> walkCursor() const {
-        assert(table_ != nullptr && "a moved-from table");
-        if (table_ == nullptr)
-            return nullptr;
-        return std::make_unique<KovBtreeCursor>(*table_, true);
-    }
-    const std::shared_ptr<std::size_t>& walks() const { return walks_; }
-
-  private:
-    void assertNoWalks() const {
-        assert(walks_ == nullptr || *walks_ == 0 ||
-               !"a table destroyed while one of its walks is alive");
-    }
-
-    std::shared_ptr<std::size_t> walks_;
-    std::unique_ptr<KovBtree> table_;
-    std::unique_ptr<KovBtreeCursor> cursor_;
-};
-
-// How an integer-keyed and a byte-keyed walk read and seek.
+// How an integer-keyed and a byte-keyed walk read and seek. Stored: a start key the walk keeps.
 struct IntKeys {
     using Key = std::int64_t;
+    using Stored = std::int64_t;
     static Key key(KovBtreeCursor& c) {
         std::int64_t k = 0;
         c.key(k);
@@ -145,6 +88,7 @@ struct IntKeys {
 
 struct ByteKeys {
     using Key = std::string_view;
+    using Stored = std::string;
     static Key key(KovBtreeCursor& c) { return c.keyView(); }
     static bool lowerBound(KovBtreeCursor& c, Key key) {
         return c.indexKeySeek(key.data(), key.size());
@@ -165,12 +109,11 @@ class Entry {
 
 struct WalkEnd {};
 
-// A walk's position: owns its cursor (move-only); equal to WalkEnd once past the last entry
-// of its range.
+// A walk's position: owns its cursor (move-only) and counts itself among its table's live
+// walks; equal to WalkEnd once past the last entry of its range.
 template <typename Keys>
 class WalkIterator {
   public:
-    WalkIterator() = default;
     WalkIterator(std::unique_ptr<KovBtreeCursor> cursor, std::shared_ptr<std::size_t> walks,
                  bool on, std::string prefix)
         : cursor_(std::move(cursor)), walks_(std::move(walks)), prefix_(std::move(prefix)) {
@@ -207,10 +150,7 @@ class WalkIterator {
 
   private:
     bool inRange() const {
-        if (prefix_.empty())
-            return true;
-        const std::string_view key = cursor_->keyView();
-        return key.substr(0, prefix_.size()) == prefix_;
+        return prefix_.empty() || cursor_->keyView().substr(0, prefix_.size()) == prefix_;
     }
     void release() {
         if (walks_ != nullptr)
@@ -225,53 +165,127 @@ class WalkIterator {
     bool on_ = false;
 };
 
-// A range: begin() starts the walk (each call a new one), end() is where it stops.
+// A range: begin() starts the walk (once), from the first entry or from the first whose key is
+// not less than `from`; end() is where it stops.
 template <typename Keys>
 class Walk {
   public:
     Walk(std::unique_ptr<KovBtreeCursor> cursor, std::shared_ptr<std::size_t> walks,
-         std::string from, std::string prefix, std::int64_t intFrom, int how)
+         std::optional<typename Keys::Stored> from, std::string prefix)
         : cursor_(std::move(cursor)),
           walks_(std::move(walks)),
           from_(std::move(from)),
-          prefix_(std::move(prefix)),
-          intFrom_(intFrom),
-          how_(how) {}
+          prefix_(std::move(prefix)) {}
 
     WalkIterator<Keys> begin() {
         std::unique_ptr<KovBtreeCursor> c = std::move(cursor_);
         bool on = false;
-        if (c != nullptr) {
-            if (how_ == kFirst)
-                on = c->first();
-            else if constexpr (std::is_same_v<Keys, IntKeys>)
-                on = Keys::lowerBound(*c, intFrom_);
-            else
-                on = Keys::lowerBound(*c, from_);
-        }
+        if (c != nullptr)
+            on = from_.has_value() ? Keys::lowerBound(*c, *from_) : c->first();
         return WalkIterator<Keys>(std::move(c), walks_, on, prefix_);
     }
     WalkEnd end() const { return {}; }
 
-    static constexpr int kFirst = 0;
-    static constexpr int kLowerBound = 1;
-
   private:
     std::unique_ptr<KovBtreeCursor> cursor_;
     std::shared_ptr<std::size_t> walks_;
-    std::string from_;
+    std::optional<typename Keys::Stored> from_;
     std::string prefix_;
-    std::int64_t intFrom_;
-    int how_;
+};
+
+// What the three tables share: the table, a writing cursor for put(), get() and contains(), the
+// count of live walks (for the debug checks above), and the walks themselves.
+template <typename Keys>
+class TableBase {
+  public:
+    using Walk = detail::Walk<Keys>;
+
+    TableBase(TableBase&&) noexcept = default;
+    TableBase& operator=(TableBase&& other) noexcept {
+        if (this != &other) {
+            assertNoWalks();
+            cursor_.reset();  // before its table
+            table_.reset();
+            walks_ = std::move(other.walks_);
+            table_ = std::move(other.table_);
+            cursor_ = std::move(other.cursor_);
+        }
+        return *this;
+    }
+    TableBase(const TableBase&) = delete;
+    TableBase& operator=(const TableBase&) = delete;
+    ~TableBase() {
+        assertNoWalks();
+        cursor_.reset();  // before its table
+    }
+
+    // Every entry, in key order.
+    WalkIterator<Keys> begin() const { return walk(std::nullopt, std::string()).begin(); }
+    WalkEnd end() const { return {}; }
+    // The entries from the first whose key is not less than `key`.
+    Walk lower_bound(typename Keys::Key key) const {
+        return walk(typename Keys::Stored(key), std::string());
+    }
+
+  protected:
+    explicit TableBase(KovBtree::TableType type)
+        : walks_(std::make_shared<std::size_t>(0)),
+          table_(std::make_unique<KovBtree>(type)),
+          cursor_(std::make_unique<KovBtreeCursor>(*table_, true)) {}
+
+    // The writing cursor; null for a moved-from table.
+    KovBtreeCursor* writer() {
+        assert(cursor_ != nullptr && "a moved-from table");
+        return cursor_.get();
+    }
+    void beforePut() const {
+        assert(walks_ == nullptr || *walks_ == 0 || !"put() while a walk of the table is alive");
+    }
+    // A walk on a cursor of its own (none for a moved-from table).
+    Walk walk(std::optional<typename Keys::Stored> from, std::string prefix) const {
+        assert(table_ != nullptr && "a moved-from table");
+        std::unique_ptr<KovBtreeCursor> c;
+        if (table_ != nullptr)
+            c = std::make_unique<KovBtreeCursor>(*table_, true);
+        return Walk(std::move(c), walks_, std::move(from), std::move(prefix));
+    }
+
+  private:
+    void assertNoWalks() const {
+        assert(walks_ == nullptr || *walks_ == 0 ||
+               !"a table destroyed while one of its walks is alive");
+    }
+
+    std::shared_ptr<std::size_t> walks_;
+    std::unique_ptr<KovBtree> table_;
+    std::unique_ptr<KovBtreeCursor> cursor_;
+};
+
+// Byte-string keys: BytesTable and IndexTable.
+class ByteKeyTable : public TableBase<ByteKeys> {
+  public:
+    // The entries whose key begins with `prefix`, in key order.
+    Walk with_prefix(std::string_view prefix) const {
+        return walk(std::string(prefix), std::string(prefix));
+    }
+
+  protected:
+    explicit ByteKeyTable(KovBtree::TableType type) : TableBase(type) {}
+
+    // The writing cursor on the entry with this key, or null.
+    KovBtreeCursor* find(std::string_view key) {
+        KovBtreeCursor* c = writer();
+        if (c == nullptr || c->seek(key.data(), key.size()) != 0)
+            return nullptr;
+        return c;
+    }
 };
 
 }  // namespace detail
 
 // Signed 64-bit keys with data.
-class IntTable : public detail::TableBase {
+class IntTable : public detail::TableBase<detail::IntKeys> {
   public:
-    using Walk = detail::Walk<detail::IntKeys>;
-
     IntTable() : TableBase(KovBtree::IntKeyTable) {}
 
     // Inserts the entry, or replaces the one with the same key.
@@ -287,59 +301,7 @@ class IntTable : public detail::TableBase {
             return std::nullopt;
         return std::string(c->dataView());
     }
-
-    // Every entry, in key order.
-    detail::WalkIterator<detail::IntKeys> begin() const { return all().begin(); }
-    detail::WalkEnd end() const { return {}; }
-    // The entries from the first whose key is not less than `key`.
-    Walk lower_bound(std::int64_t key) const {
-        return Walk(walkCursor(), walks(), std::string(), std::string(), key, Walk::kLowerBound);
-    }
-
-  private:
-    Walk all() const {
-        return Walk(walkCursor(), walks(), std::string(), std::string(), 0, Walk::kFirst);
-    }
 };
-
-namespace detail {
-
-// Byte-string keys: BytesTable and IndexTable.
-class ByteKeyTable : public TableBase {
-  public:
-    using Walk = detail::Walk<ByteKeys>;
-
-    // Every entry, in key order.
-    WalkIterator<ByteKeys> begin() const { return all().begin(); }
-    WalkEnd end() const { return {}; }
-    // The entries from the first whose key is not less than `key`.
-    Walk lower_bound(std::string_view key) const {
-        return Walk(walkCursor(), walks(), std::string(key), std::string(), 0, Walk::kLowerBound);
-    }
-    // The entries whose key begins with `prefix`, in key order.
-    Walk with_prefix(std::string_view prefix) const {
-        return Walk(walkCursor(), walks(), std::string(prefix), std::string(prefix), 0,
-                    Walk::kLowerBound);
-    }
-
-  protected:
-    explicit ByteKeyTable(KovBtree::TableType type) : TableBase(type) {}
-
-    // The writing cursor on the entry with this key, or null.
-    KovBtreeCursor* find(std::string_view key) {
-        KovBtreeCursor* c = writer();
-        if (c == nullptr || c->seek(key.data(), key.size()) != 0)
-            return nullptr;
-        return c;
-    }
-
-  private:
-    Walk all() const {
-        return Walk(walkCursor(), walks(), std::string(), std::string(), 0, Walk::kFirst);
-    }
-};
-
-}  // namespace detail
 
 // Byte-string keys with data.
 class BytesTable : public detail::ByteKeyTable {
