@@ -119,7 +119,9 @@ void kovsq_clear(KovsqCursor *cursor);
 
 /* One search. *cmp: 0 = on an equal entry; negative = on an entry smaller
  * than the key, or on no entry when the table is empty; positive = on an
- * entry larger than the key. Which neighbour it lands on is SQLite's. */
+ * entry larger than the key. Which neighbour it lands on is the search's
+ * (SQLite's descent for integer keys; for byte keys the same descent with a
+ * comparison of the key field alone). */
 int kovsq_seek_int(KovsqCursor *cursor, int64_t key, int *cmp);
 int kovsq_seek_key(KovsqCursor *cursor, const void *key, uint32_t keySize, int *cmp);
 

@@ -467,6 +467,56 @@ TEST_F(EngineMovetoBytes, NullKeyRefusedWithCorruptAndCursorStays) {
     EXPECT_EQ(currentKey(cur->get()), "dd");
 }
 
+// Keys far longer than a page share long prefixes and differ only near their ends, or are
+// prefixes of one another: the search reads from the overflow pages as much of each key as the
+// comparison needs, and every search lands where a std::map's lower_bound says, on the smallest
+// key not less than the one sought, with the larger neighbour's result (positive) or, past the
+// last key, on the last with a negative one. Inserts searched the same way replace equal keys.
+TEST(EngineMoveto, LongKeysSharingLongPrefixesOrderByEveryByte) {
+    for (int flags : {kByteTable, kKeyOnlyTable}) {
+        TestEngine engine;
+        const std::uint32_t root = engine.createTable(flags);
+        ASSERT_NE(root, 0u);
+        TestCursor cur(engine.get(), root, 1);
+        std::map<std::string, std::string> model;
+        std::mt19937 rng(11);
+        const std::string common(3000, 'p');
+        auto someKey = [&] {
+            std::string k = common.substr(0, rng() % 2 == 0 ? 3000 : 1500 + rng() % 1500);
+            const std::size_t tail = rng() % 4;
+            for (std::size_t i = 0; i < tail; ++i)
+                k.push_back("\x00p\xff"[rng() % 3]);
+            return k;
+        };
+        for (int i = 0; i < 400; ++i) {
+            const std::string k = someKey();
+            const std::string d = flags == kByteTable ? std::to_string(i) : std::string();
+            ASSERT_EQ(insertBytes(cur.get(), k, d), SQLITE_OK);
+            model[k] = d;
+        }
+        ASSERT_EQ(walkBytes(cur.get()),
+                  (std::vector<std::pair<std::string, std::string>>(model.begin(), model.end())));
+        for (int i = 0; i < 600; ++i) {
+            const std::string k = someKey();
+            const int cmp = seekBytes(cur.get(), k);
+            const auto at = model.lower_bound(k);
+            if (at == model.end()) {
+                EXPECT_LT(cmp, 0) << k.size();
+                EXPECT_EQ(currentKey(cur.get()), model.rbegin()->first);
+            } else {
+                if (at->first == k) {
+                    EXPECT_EQ(cmp, 0) << k.size();
+                } else {
+                    EXPECT_GT(cmp, 0) << k.size();
+                }
+                EXPECT_EQ(currentKey(cur.get()), at->first) << k.size();
+                EXPECT_EQ(currentData(cur.get()), at->second);
+            }
+        }
+        EXPECT_EQ(integrityProblems(engine.get()), "");
+    }
+}
+
 TEST(EngineMoveto, NullKeyOnKeyOnlyTableRefusedWithCorrupt) {
     TestEngine engine;
     std::uint32_t root = engine.createTable(kKeyOnlyTable);
