@@ -149,11 +149,13 @@ bool KovBtreeCursor::indexKeySeek(const void* key, std::uint64_t size) {
 // IntKeyTable, or standing on an integer key (a cursor kept over a reset may have been reopened
 // on such a table), has no key bytes and fetches nothing.
 std::string_view KovBtreeCursor::keyView() {
+    // The engine hands out no key bytes on no entry and on an integer-keyed table: both give
+    // the empty view, so the table's kind needs no look of its own here.
     std::uint32_t length = 0;
-    const unsigned char* key = currentKey(length);
+    const void* key = eng::sqlite3BtreeKeyFetch(handle(), &length);
     if (key == nullptr)
         return {};
-    return {reinterpret_cast<const char*>(key), length};
+    return {static_cast<const char*>(key), length};
 }
 
 std::string_view KovBtreeCursor::dataView() {
