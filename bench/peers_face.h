@@ -1,6 +1,6 @@
 // The store through its C++17 face (<kovpager/kovpager.hpp>), as a host that uses it would: one
-// table of the workload's kind for the whole run; reads through range-for walks and get(), keys
-// and data read in place where the face hands out views.
+// table of the workload's kind for the whole run; reads through range-for walks and get_view(),
+// keys and data read in place.
 #ifndef KOVPAGER_BENCH_PEERS_FACE_H
 #define KOVPAGER_BENCH_PEERS_FACE_H
 
@@ -38,7 +38,7 @@ class FaceBackend {
     void keyInsert(const unsigned char* key, std::size_t keySize) { keys_->put(view(key, keySize)); }
     void increment(const unsigned char* key, std::size_t keySize) {
         std::uint64_t count = 0;
-        if (const std::optional<std::string> old = bytes_->get(view(key, keySize)))
+        if (const std::optional<std::string_view> old = bytes_->get_view(view(key, keySize)))
             std::memcpy(&count, old->data(), old->size() < sizeof count ? old->size() : sizeof count);
         ++count;
         bytes_->put(view(key, keySize),
@@ -66,7 +66,7 @@ class FaceBackend {
 
     // A point seek with the data read; false when the key is missing.
     bool seek(const unsigned char* key, std::size_t keySize, kov::bench::Tally& tally) {
-        const std::optional<std::string> data = bytes_->get(view(key, keySize));
+        const std::optional<std::string_view> data = bytes_->get_view(view(key, keySize));
         if (!data.has_value())
             return false;
         tally.add(key, keySize, reinterpret_cast<const unsigned char*>(data->data()));

@@ -54,8 +54,8 @@ SETTINGS = {
              "per table; temporary file in KOV_TEMP; W7: seek, data() of the 8-byte count when "
              "found, insert of count + 1 on a BlobTable",
     "face": "the store through <kovpager/kovpager.hpp>: one table object; walks by range-for "
-            "reading key() and data() in place, seeks by get() (a std::string copy of the "
-            "data); W7: get, then put",
+            "reading key() and data() in place, seeks by get_view() (the data in place); W7: "
+            "get_view, then put",
     "sqlite": "hand-written SQL through the system's SQLite (Debian's libsqlite3): temporary "
               "database (empty name), page_size 4096, cache_size 16384 "
               "(64 MiB), journal_mode OFF, locking_mode EXCLUSIVE, synchronous OFF, one BEGIN "

@@ -1,6 +1,6 @@
-// The C++17 face (<kovpager/kovpager.hpp>): put, get and contains, range-for walks, lower_bound
-// and with_prefix on the three tables, checked against std::map models with random operations;
-// views compared byte for byte; moves; failed(), failure() and reset() forwarded.
+// The C++17 face (<kovpager/kovpager.hpp>): put, get, get_view and contains, range-for walks,
+// lower_bound and with_prefix on the three tables, checked against std::map models with random
+// operations; views compared byte for byte; moves; failed(), failure() and reset() forwarded.
 #include <gtest/gtest.h>
 
 #include <cstdint>
@@ -57,8 +57,13 @@ TEST_F(Face, BytesTableMatchesAMap) {
             table.put(key, data);
             model[key] = data;
         } else {
-            const std::optional<std::string> got = table.get(key);
             const auto it = model.find(key);
+            const std::optional<std::string_view> view = table.get_view(key);
+            ASSERT_EQ(view.has_value(), it != model.end()) << step;
+            if (view.has_value()) {
+                ASSERT_EQ(*view, it->second) << step;
+            }
+            const std::optional<std::string> got = table.get(key);
             ASSERT_EQ(got.has_value(), it != model.end()) << step;
             if (got.has_value()) {
                 ASSERT_EQ(*got, it->second) << step;
@@ -100,8 +105,13 @@ TEST_F(Face, IntTableMatchesAMap) {
             table.put(key, data);
             model[key] = data;
         } else {
-            const std::optional<std::string> got = table.get(key);
             const auto it = model.find(key);
+            const std::optional<std::string_view> view = table.get_view(key);
+            ASSERT_EQ(view.has_value(), it != model.end());
+            if (view.has_value()) {
+                ASSERT_EQ(*view, it->second);
+            }
+            const std::optional<std::string> got = table.get(key);
             ASSERT_EQ(got.has_value(), it != model.end());
             if (got.has_value()) {
                 ASSERT_EQ(*got, it->second);
@@ -174,6 +184,37 @@ TEST_F(Face, WalksAreIndependentAndSurviveTableCreation) {
         ++expected;
     }
     EXPECT_EQ(expected, 100);
+}
+
+// get_view hands out the data where it lies: the view of a key that is on its page points into
+// the same bytes as a walk's data() of that entry, it stays put while walks of the table and
+// reads of other tables go on, and data on overflow pages is whole. Absent keys give nothing.
+TEST_F(Face, GetViewReadsTheDataInPlace) {
+    kovpager::BytesTable table;
+    kovpager::IntTable other;
+    const std::string big(9000, 'b');
+    table.put("a", "alpha");
+    table.put("big", big);
+    table.put("c", "gamma");
+    other.put(7, "seven");
+    EXPECT_EQ(table.get_view("zz"), std::nullopt);
+    EXPECT_EQ(other.get_view(8), std::nullopt);
+
+    const std::optional<std::string_view> alpha = table.get_view("a");
+    ASSERT_TRUE(alpha.has_value());
+    EXPECT_EQ(*alpha, "alpha");
+    const char* const where = alpha->data();
+    auto walk = table.begin();
+    ASSERT_TRUE(walk != table.end());
+    EXPECT_EQ((*walk).data().data(), where);  // the same bytes: no copy on either side
+    for (const auto& e : table)
+        EXPECT_FALSE(e.key().empty());
+    EXPECT_EQ(other.get_view(7), std::optional<std::string_view>("seven"));
+    EXPECT_EQ(alpha->data(), where);
+    EXPECT_EQ(*alpha, "alpha");  // still valid: no put, get or get_view on its table since
+
+    EXPECT_EQ(table.get_view("big"), std::optional<std::string_view>(big));
+    EXPECT_EQ(table.get_view("c"), std::optional<std::string_view>("gamma"));
 }
 
 // Tables move: the new owner has the entries, the moved-from one is empty.
@@ -284,9 +325,9 @@ TEST_F(Face, RandomProgramsOverSeveralTablesMatchTheModels) {
                 if (t.kind == 0) {
                     const std::int64_t k = static_cast<std::int64_t>(rng() % 300) - 150;
                     const auto it = t.intModel.find(k);
-                    ASSERT_EQ(t.ints->get(k), it == t.intModel.end()
-                                                  ? std::nullopt
-                                                  : std::optional<std::string>(it->second));
+                    ASSERT_EQ(t.ints->get_view(k), it == t.intModel.end()
+                                                       ? std::nullopt
+                                                       : std::optional<std::string_view>(it->second));
                 } else {
                     const std::string k = randomBytes(rng, 5);
                     const auto it = t.byteModel.find(k);

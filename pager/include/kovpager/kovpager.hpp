@@ -5,6 +5,7 @@
 //   kovpager::BytesTable users;                          // a new, empty table
 //   users.put("alice", "admin");                         // inserts, or replaces
 //   std::optional<std::string> role = users.get("alice");
+//   std::optional<std::string_view> in_place = users.get_view("alice");  // no copy
 //   for (const auto& e : users)                          // key order
 //       std::cout << e.key() << " = " << e.data() << "\n";
 //   for (const auto& e : users.with_prefix("al")) ...    // keys beginning with "al"
@@ -22,7 +23,9 @@
 // std::string_view of the key's bytes) and data() (a std::string_view; empty on IndexTable).
 // Views point into the store's memory: they are valid until the walk advances or ends, until
 // any put() into that table, the construction of any table, or reset(). Copy what must live
-// longer (std::string(e.data())).
+// longer (std::string(e.data())). get_view(key) hands out the data of one key the same way,
+// valid until the next put(), get() or get_view() on that table, the construction of any
+// table, or reset().
 //
 // Misuse, and what happens:
 //   - put() into a table while one of its walks is alive: the walk's position is lost (it may
@@ -193,8 +196,8 @@ class Walk {
     std::string prefix_;
 };
 
-// What the three tables share: the table, a writing cursor for put(), get() and contains(), the
-// count of live walks (for the debug checks above), and the walks themselves.
+// What the three tables share: the table, a writing cursor for put(), get(), get_view() and
+// contains(), the count of live walks (for the debug checks above), and the walks themselves.
 template <typename Keys>
 class TableBase {
   public:
@@ -237,6 +240,11 @@ class TableBase {
     KovBtreeCursor* writer() {
         assert(cursor_ != nullptr && "a moved-from table");
         return cursor_.get();
+    }
+    static std::optional<std::string> copied(std::optional<std::string_view> data) {
+        if (!data.has_value())
+            return std::nullopt;
+        return std::string(*data);
     }
     void beforePut() const {
         assert(walks_ == nullptr || *walks_ == 0 || !"put() while a walk of the table is alive");
@@ -295,11 +303,14 @@ class IntTable : public detail::TableBase<detail::IntKeys> {
             c->insert(key, data.data(), data.size());
     }
     // The data of `key`, or nothing when there is no such entry.
-    std::optional<std::string> get(std::int64_t key) {
+    std::optional<std::string> get(std::int64_t key) { return copied(get_view(key)); }
+    // The same without a copy: a view of the data where it lies, valid until the next put(),
+    // get() or get_view() on this table, the construction of any table, or reset().
+    std::optional<std::string_view> get_view(std::int64_t key) {
         KovBtreeCursor* c = writer();
         if (c == nullptr || c->seek(key) != 0)
             return std::nullopt;
-        return std::string(c->dataView());
+        return c->dataView();
     }
 };
 
@@ -315,11 +326,14 @@ class BytesTable : public detail::ByteKeyTable {
             c->insert(key.data(), key.size(), data.data(), data.size());
     }
     // The data of `key`, or nothing when there is no such entry.
-    std::optional<std::string> get(std::string_view key) {
+    std::optional<std::string> get(std::string_view key) { return copied(get_view(key)); }
+    // The same without a copy: a view of the data where it lies, valid until the next put(),
+    // get() or get_view() on this table, the construction of any table, or reset().
+    std::optional<std::string_view> get_view(std::string_view key) {
         KovBtreeCursor* c = find(key);
         if (c == nullptr)
             return std::nullopt;
-        return std::string(c->dataView());
+        return c->dataView();
     }
 };
 
