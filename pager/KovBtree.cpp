@@ -1,10 +1,8 @@
-// Tables: creation around the cursor registry's close-all and restore-all, best-effort drop.
+// Tables: creation through the cursor registry (every cursor closed around it), best-effort drop.
 #include <kovpager/KovBtree.h>
 
-#include <string>
-#include <vector>
-
 #include "engine/btree.h"
+#include "pager/CursorRegistry.h"
 
 namespace eng = kov::engine;
 
@@ -25,12 +23,9 @@ KovBtree::KovBtree(TableType type) : pager_(KovPager::instance()), rootPage_(0),
     if (pager_->openEngine() == nullptr)
         pager_->initialize();
     tableFlags_ = flagsOf(type);
-    rootPage_ = 0;
-    // The engine creates no table while a cursor is open: close them all around the creation.
-    std::vector<std::string> saved;
-    pager_->closeAllCursors(saved);
-    eng::sqlite3BtreeCreateTable(pager_->engine_, &rootPage_, static_cast<int>(tableFlags_));
-    pager_->restoreAllCursors(saved);
+    // The engine creates no table while a cursor is open: the registry closes them all around
+    // the creation.
+    rootPage_ = kov::pager::CursorRegistry::createTable(*pager_, tableFlags_);
 }
 
 KovBtree::~KovBtree() {

@@ -6,47 +6,30 @@
 // false, seeks negative, sizes 0.
 #include <kovpager/KovBtreeCursor.h>
 
-#include <cassert>
 #include <cstring>
 
 #include "engine/btree.h"
+#include "pager/CursorRegistry.h"
 
 namespace eng = kov::engine;
+using kov::pager::CursorRegistry;
+using kov::pager::CursorSlot;
 
 KovBtreeCursor::KovBtreeCursor(const KovBtree& table, bool write)
     : registry_(nullptr), slotIndex_(0) {
     KovPager* pager = KovPager::instance();
     registry_ = &pager->cursorSlots_;
-    slotIndex_ = registry_->size();
-    // Built before the append: push_back may move the registry's storage.
-    const CursorSlot slot{nullptr, table.rootPage_, table.tableFlags_};
-    registry_->push_back(slot);
-    eng::sqlite3BtreeCursor(pager->openEngine(), table.rootPage_, write ? 1 : 0, nullptr, nullptr,
-                            &(*registry_)[slotIndex_].cursor);
+    slotIndex_ = CursorRegistry::add(*pager, table.rootPage_, table.tableFlags_, write);
 }
 
 KovBtreeCursor::~KovBtreeCursor() {
-    KovPager* pager = KovPager::instance();
-    // With the engine closed (reset, or the exit-time teardown) the slot stays as it is.
-    if (pager->openEngine() == nullptr)
-        return;
-    std::vector<CursorSlot>& slots = *registry_;
-    if (slotIndex_ >= slots.size())
-        return;
-    CursorSlot& slot = slots[slotIndex_];
-    if (slot.cursor != nullptr)
-        eng::sqlite3BtreeCloseCursor(slot.cursor);
-    slot.cursor = nullptr;
-    slot.rootPage = CursorSlot::freeSlot_;
-    while (!slots.empty() && slots.back().rootPage == CursorSlot::freeSlot_)
-        slots.pop_back();
-    // The registry never ends in a free slot (KovPager.cpp, design note 2).
-    assert(slots.empty() || slots.back().rootPage != CursorSlot::freeSlot_);
+    CursorRegistry::release(*KovPager::instance(), slotIndex_);
 }
 
 eng::BtCursor* KovBtreeCursor::handle() const {
     // The registry is emptied by the pager's teardown; a cursor that outlives it has no handle.
-    return slotIndex_ < registry_->size() ? (*registry_)[slotIndex_].cursor : nullptr;
+    const CursorSlot* slot = CursorRegistry::at(*registry_, slotIndex_);
+    return slot != nullptr ? slot->cursor : nullptr;
 }
 
 bool KovBtreeCursor::first() {
@@ -168,8 +151,8 @@ std::string_view KovBtreeCursor::dataView() {
 
 const unsigned char* KovBtreeCursor::currentKey(std::uint32_t& length) {
     length = 0;
-    if (slotIndex_ < registry_->size() &&
-        ((*registry_)[slotIndex_].tableFlags & eng::BTREE_INTKEY) != 0)
+    const CursorSlot* slot = CursorRegistry::at(*registry_, slotIndex_);
+    if (slot != nullptr && CursorRegistry::hasIntegerKeys(*slot))
         return nullptr;  // opened on an IntKeyTable
     eng::BtCursor* cursor = handle();
     const void* key = eng::sqlite3BtreeKeyFetch(cursor, &length);

@@ -9,26 +9,13 @@
 //    not destroy the object, so host objects destroyed later still find a valid pager with no
 //    engine (and do nothing).
 //
-// 2. The registry. cursorSlots_ holds one CursorSlot per registered cursor, in order of
-//    registration; a cursor names its slot by index. Slot states (checked with assert in debug
-//    builds by checkRegistry at every change of the registry):
-//
-//      state                   cursor        rootPage
-//      live, open              engine cursor table's root
-//      live, refused           null          table's root   (the engine refused the cursor)
-//      live, closed            null          table's root   (inside a table creation only)
-//      live, stale             inert cursor  table's root   (after reset(); freed by the next
-//                                                            closeAllCursors or by teardown)
-//      free                    null          0xFFFFFFFF
-//
-//    Slots are appended, never reused; only trailing free slots are removed, so the index of a
-//    live slot never changes. A slot is released only while the engine is open.
+// 2. The registry. cursorSlots_ holds one CursorSlot per registered cursor; its rules (the slot
+//    states, the invariants) and every change to it are in CursorRegistry (pager/CursorRegistry.h).
 //
 // 3. Table creation. The engine refuses to create (or drop) a table while any cursor is open, so
-//    KovBtree's constructor calls closeAllCursors() (saving each live cursor's key: 8 native-order
-//    bytes of the integer key, or the whole byte-string key; a cursor on no entry saves 0 or the
-//    empty key), creates the table, then restoreAllCursors() (reopening every live slot as a
-//    writing cursor and searching for its saved key, which lands on that key when it still exists).
+//    KovBtree's constructor creates its table through CursorRegistry::createTable: closeAllCursors()
+//    (each live cursor's key kept), the creation, restoreAllCursors() (every live slot reopened as a
+//    writing cursor on its key).
 //
 // 4. The temporary directory. tempDir_ is the pager's own copy of the directory; the engine's
 //    directory setting points into its buffer from construction until teardown, and operator=
@@ -39,7 +26,8 @@
 //
 // 5. The store's results do not depend on engine status codes: a refusal is a silent no-op.
 //    Out-values are initialised before each engine call, so a refused call reads as "no entry".
-//    (The one code looked at is that of the zero-byte key read in closeAllCursors; see there.)
+//    (The one code looked at is that of the zero-byte key read when a cursor's key is kept for a
+//    table creation; see CursorRegistry.cpp.)
 //    Failures are kept apart from results: the engine keeps its first one, initialize() the
 //    failure to open an engine (openFailure_), and failed()/failure() read both.
 //
@@ -51,37 +39,20 @@
 //    holds any more). So every handle the pager uses is open or inert, never freed.
 #include <kovpager/KovPager.h>
 
-#include <cassert>
 #include <cstdlib>
-#include <cstring>
 #include <new>
 #include <unordered_set>
 
 #include "engine/btree.h"
+#include "pager/CursorRegistry.h"
 #include "tempdir/TempDirectory.h"
 
 namespace eng = kov::engine;
 
-namespace {
+using kov::pager::CursorRegistry;
+using kov::pager::CursorSlot;
 
-// The registry's invariants (design note 2): a free slot holds no engine cursor, the last slot is
-// never free (trailing free slots are removed at once), and no engine cursor is named by two
-// slots (each slot closes its own). `closed`: inside a table creation, between closeAllCursors
-// and restoreAllCursors, every live slot's engine cursor is closed too.
-void checkRegistry(const std::vector<CursorSlot>& slots, bool closed = false) {
-#ifndef NDEBUG
-    std::unordered_set<const eng::BtCursor*> seen;
-    for (const CursorSlot& slot : slots) {
-        assert(slot.rootPage != CursorSlot::freeSlot_ || slot.cursor == nullptr);
-        assert(!closed || slot.cursor == nullptr);
-        assert(slot.cursor == nullptr || seen.insert(slot.cursor).second);
-    }
-    assert(slots.empty() || slots.back().rootPage != CursorSlot::freeSlot_);
-#else
-    (void)slots;
-    (void)closed;
-#endif
-}
+namespace {
 
 // Storage of the one pager. Static, so it outlives every host object.
 alignas(KovPager) unsigned char gPagerStorage[sizeof(KovPager)];
@@ -163,7 +134,7 @@ KovPager& KovPager::operator=(const KovPager& other) {
     for (eng::BtCursor* orphan : held)
         eng::sqlite3BtreeCloseCursor(orphan);
     cursorSlots_ = std::move(slots);
-    checkRegistry(cursorSlots_);
+    CursorRegistry::check(cursorSlots_);
 
     tempDir_ = other.tempDir_;
     openFailure_ = other.openFailure_;
@@ -247,57 +218,11 @@ std::string KovPager::failure() const {
 }
 
 void KovPager::closeAllCursors(std::vector<std::string>& saved) {
-    checkRegistry(cursorSlots_);
-    saved.resize(cursorSlots_.size());
-    for (std::size_t i = 0; i < cursorSlots_.size(); ++i) {
-        CursorSlot& slot = cursorSlots_[i];
-        if (slot.rootPage == CursorSlot::freeSlot_)
-            continue;
-        std::int64_t size = 0;
-        eng::sqlite3BtreeKeySize(slot.cursor, &size);
-        std::string& key = saved[i];
-        if ((slot.tableFlags & eng::BTREE_INTKEY) != 0) {
-            key.resize(sizeof size);
-            std::memcpy(key.data(), &size, sizeof size);
-        } else {
-            // A slot registered before a reset may have been reopened on an integer-keyed table
-            // of the new engine; its "size" is then an integer key. The engine refuses a byte
-            // read on such a table, even of zero bytes: the key is then saved as empty.
-            if (size > 0 && eng::sqlite3BtreeKey(slot.cursor, 0, 0, nullptr) != eng::SQLITE_OK) {
-                size = 0;
-            }
-            key.resize(size > 0 ? static_cast<std::size_t>(size) : 0);
-            if (size > 0) {
-                eng::sqlite3BtreeKey(slot.cursor, 0, static_cast<std::uint32_t>(size), key.data());
-            }
-        }
-        if (slot.cursor != nullptr)
-            eng::sqlite3BtreeCloseCursor(slot.cursor);
-        slot.cursor = nullptr;
-    }
-    checkRegistry(cursorSlots_, true);
+    CursorRegistry::closeAll(cursorSlots_, saved);
 }
 
 void KovPager::restoreAllCursors(const std::vector<std::string>& saved) {
-    for (std::size_t i = 0; i < cursorSlots_.size(); ++i) {
-        if (cursorSlots_[i].rootPage == CursorSlot::freeSlot_)
-            continue;
-        eng::sqlite3BtreeCursor(engine_, cursorSlots_[i].rootPage, 1, nullptr, nullptr,
-                                &cursorSlots_[i].cursor);
-        const std::string empty;
-        const std::string& key = i < saved.size() ? saved[i] : empty;
-        int compare = 0;
-        if ((cursorSlots_[i].tableFlags & eng::BTREE_INTKEY) != 0) {
-            std::int64_t intKey = 0;
-            std::memcpy(&intKey, key.data(),
-                        key.size() < sizeof intKey ? key.size() : sizeof intKey);
-            eng::sqlite3BtreeMoveto(cursorSlots_[i].cursor, nullptr, intKey, &compare);
-        } else {
-            eng::sqlite3BtreeMoveto(cursorSlots_[i].cursor, key.data(),
-                                    static_cast<std::int64_t>(key.size()), &compare);
-        }
-    }
-    checkRegistry(cursorSlots_);
+    CursorRegistry::restoreAll(engine_, cursorSlots_, saved);
 }
 
 void KovPager::teardown() {

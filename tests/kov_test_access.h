@@ -30,7 +30,7 @@ struct KovTestAccess {
     static std::int64_t defaultCacheSize() { return KovPager::defaultCacheSize_; }
 
     // The cursor registry.
-    static const std::vector<CursorSlot>& slots() { return KovPager::instance()->cursorSlots_; }
+    static const std::vector<kov::pager::CursorSlot>& slots() { return KovPager::instance()->cursorSlots_; }
 
     // The engine handle; null while the engine is closed.
     static kov::engine::Btree* engine() { return KovPager::instance()->engine_; }

@@ -111,10 +111,10 @@ TEST_F(StoreTest, UnpositionedAndPastEndCursorsAreSavedAsZeroOrEmptyKey) {
     ASSERT_EQ(saved.size(), 4u);
     EXPECT_EQ(saved[2], bytes8(0));
     EXPECT_EQ(saved[3], "");
-    for (const CursorSlot& s : KovTestAccess::slots())
+    for (const kov::pager::CursorSlot& s : KovTestAccess::slots())
         EXPECT_EQ(s.cursor, nullptr);
     KovTestAccess::restoreAllCursors(saved);
-    for (const CursorSlot& s : KovTestAccess::slots())
+    for (const kov::pager::CursorSlot& s : KovTestAccess::slots())
         EXPECT_NE(s.cursor, nullptr);
 
     // Searched for 0 and for the empty key: on a non-empty table they come back on an entry.

@@ -27,7 +27,7 @@ inline std::string storeIntegrityProblems() {
     return engine == nullptr ? std::string() : kov::engine::test::integrityProblems(engine);
 }
 
-constexpr std::uint32_t kFreeSlot = CursorSlot::freeSlot_;
+constexpr std::uint32_t kFreeSlot = kov::pager::CursorSlot::freeSlot_;
 
 inline void insertBytes(KovBtreeCursor& c, const std::string& key, const std::string& data) {
     c.insert(key.data(), key.size(), data.data(), data.size());
@@ -79,7 +79,7 @@ inline std::vector<std::pair<std::int64_t, std::string>> walkInts(KovBtreeCursor
     return out;
 }
 
-inline const CursorSlot& slotOf(const KovBtreeCursor& c) {
+inline const kov::pager::CursorSlot& slotOf(const KovBtreeCursor& c) {
     return KovTestAccess::slots().at(static_cast<std::size_t>(KovTestAccess::slotIndex(c)));
 }
 

@@ -1426,7 +1426,7 @@ class StoreProgram::Impl {
             // The key in place. Once the model has stopped following the store (a pager copy
             // assigned back), the engine cursor may stand on a table of integer keys at this
             // root, whose key size is the integer key, no length: there is no byte key to take.
-            const std::vector<CursorSlot>& registry = KovTestAccess::slots();
+            const std::vector<kov::pager::CursorSlot>& registry = KovTestAccess::slots();
             const auto index = static_cast<std::size_t>(KovTestAccess::slotIndex(*c->obj));
             if (index >= registry.size())
                 return;

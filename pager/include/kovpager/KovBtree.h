@@ -37,8 +37,10 @@ class KOVPAGER_EXPORT KovBtree {
         IndexTable = 2,   // byte-string keys only
     };
 
-    // Creates an empty table of the given kind. Throws only allocation errors; then no table is
-    // made and cursors closed so far stay closed.
+    // Creates an empty table of the given kind. Throws only allocation errors; then the host has
+    // no table (one the engine made already stays, unreachable, until the engine closes) and
+    // every cursor is open again on its entry, but one whose own reopening ran out of memory,
+    // which answers as on no entry (as a refused cursor does).
     explicit KovBtree(TableType type);
 
     // Drops the table when no cursor is open anywhere in the process.

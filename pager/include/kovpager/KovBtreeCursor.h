@@ -168,7 +168,7 @@ class KOVPAGER_EXPORT KovBtreeCursor {
     static bool matchAndCopy(const unsigned char* key, const void* prefix,
                              std::uint64_t prefixSize, void* payload, std::uint64_t payloadSize);
 
-    std::vector<CursorSlot>* registry_;
+    std::vector<kov::pager::CursorSlot>* registry_;
     std::uint64_t slotIndex_;
 };
 

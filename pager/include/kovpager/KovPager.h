@@ -47,13 +47,19 @@
 #define KOVPAGER_EXPORT __attribute__((visibility("default")))
 #endif
 
+// The library's own names, which a host does not use.
 namespace kov::engine {
 struct Btree;
 struct BtCursor;
 }  // namespace kov::engine
 
+namespace kov::pager {
+
+class CursorRegistry;
+
 // One registered cursor: the engine cursor, the root page of its table (freeSlot_ marks a free
-// slot) and the table's engine flags (bit 0 set: integer keys).
+// slot) and the table's engine flags (bit 0 set: integer keys). The registry's rules are in the
+// library's pager/CursorRegistry.h.
 struct CursorSlot {
     // The rootPage of a free slot.
     static constexpr std::uint32_t freeSlot_ = 0xFFFFFFFFu;
@@ -62,6 +68,8 @@ struct CursorSlot {
     std::uint32_t rootPage;         // table the cursor walks; freeSlot_ = free slot
     std::uint32_t tableFlags;       // the table's flags when the cursor was registered
 };
+
+}  // namespace kov::pager
 
 class KovBtree;
 class KovBtreeCursor;
@@ -111,6 +119,7 @@ class KOVPAGER_EXPORT KovPager {
   private:
     friend class KovBtree;
     friend class KovBtreeCursor;
+    friend class kov::pager::CursorRegistry;
     // The unit tests' window on the private state. Declared here, defined only by the tests; the
     // library neither defines nor exports it.
     friend struct KovTestAccess;
@@ -142,7 +151,7 @@ class KOVPAGER_EXPORT KovPager {
     void teardown();
 
     kov::engine::Btree* engine_;
-    std::vector<CursorSlot> cursorSlots_;
+    std::vector<kov::pager::CursorSlot> cursorSlots_;
     std::string tempDir_;
     // SQLite's result code when opening the engine failed since the last reset(), else 0.
     int openFailure_;
