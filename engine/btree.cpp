@@ -58,6 +58,19 @@
 #include <unordered_map>
 #include <vector>
 
+// The codes engine/btree.h declares with SQLite's names and values, listed once: read here
+// before SQLite's header makes those names its macros, and again after, and compared.
+#define KOV_SQLITE_CODES(X)                                                                     \
+    X(SQLITE_OK) X(SQLITE_ERROR) X(SQLITE_PERM) X(SQLITE_LOCKED) X(SQLITE_NOMEM)                 \
+    X(SQLITE_READONLY) X(SQLITE_IOERR) X(SQLITE_CORRUPT) X(SQLITE_FULL) X(SQLITE_TOOBIG)        \
+    X(SQLITE_MISUSE) X(SQLITE_TXN_NONE) X(SQLITE_TXN_READ) X(SQLITE_TXN_WRITE)
+#define KOV_SQLITE_CODE_VALUE(name) name,
+namespace kov::engine {
+namespace {
+constexpr int kDeclaredCodes[] = {KOV_SQLITE_CODES(KOV_SQLITE_CODE_VALUE)};
+}  // namespace
+}  // namespace kov::engine
+
 // After engine/btree.h: its result codes share SQLite's macro names.
 #include "engine/private_sqlite3.h"
 #include "engine/page_cache.h"
@@ -66,6 +79,24 @@
 #include "engine/temp_file.h"
 
 namespace kov::engine {
+
+namespace {
+
+constexpr int kSqliteCodes[] = {KOV_SQLITE_CODES(KOV_SQLITE_CODE_VALUE)};
+#undef KOV_SQLITE_CODE_VALUE
+#undef KOV_SQLITE_CODES
+
+constexpr bool sameCodes() {
+    for (std::size_t i = 0; i < sizeof kSqliteCodes / sizeof kSqliteCodes[0]; ++i) {
+        if (kDeclaredCodes[i] != kSqliteCodes[i])
+            return false;
+    }
+    return true;
+}
+static_assert(sizeof kDeclaredCodes == sizeof kSqliteCodes && sameCodes(),
+              "engine/btree.h declares a result code with another value than SQLite's");
+
+}  // namespace
 
 namespace {
 

@@ -94,7 +94,7 @@ namespace kov::engine {
 struct Btree;     // one private connection holding one temporary database
 struct BtCursor;  // a position in one table
 
-// Result codes, with SQLite's values.
+// Result codes, with SQLite's values (btree.cpp checks them against SQLite's header).
 enum : int {
     SQLITE_OK = 0,
     SQLITE_ERROR = 1,

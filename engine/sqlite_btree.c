@@ -8,10 +8,10 @@
  * cmake/SqliteAmalgamation.cmake) and hidden, so this SQLite never meets a
  * host's.
  *
- * Checked against SQLite 3.40.1 (SQLITE_VERSION_NUMBER 3040001, Debian's
- * sqlite3 3.40.1-2+deb12u2); the build refuses any other version. These are
- * the internals relied on; check each of them against a new version before
- * moving to it.
+ * Checked against the one SQLite version that cmake/SqliteAmalgamation.cmake
+ * names (KOVPAGER_SQLITE_VERSION_NUMBER, Debian 12's sqlite3); the build
+ * refuses any other. These are the internals relied on; check each of them
+ * against a new version before moving to it.
  *
  *   Structures
  *     sqlite3.aDb[0].pBt   the main database's Btree of a connection
@@ -63,7 +63,7 @@
  *     BtShared.maxLocal and BtShared.maxLeaf (the largest payload kept on an
  *     index or a table leaf page without overflow).
  *
- * Behaviour relied on, found by reading 3.40.1 (see also the pitfalls noted
+ * Behaviour relied on, found by reading that version (see also the pitfalls noted
  * at each function):
  *   - The parsed cell (BtCursor.info) is only valid after getCellInfo since
  *     the last move (sqlite3BtreePayloadFetch does not parse the cell, and
@@ -97,8 +97,8 @@
 
 #include "sqlite3.c"
 
-#if SQLITE_VERSION_NUMBER != 3040001
-#error "engine/sqlite_btree.c was checked against SQLite 3.40.1 only: check the internals named at its top against this version first"
+#if !defined(KOVPAGER_SQLITE_CHECKED_VERSION) || SQLITE_VERSION_NUMBER != KOVPAGER_SQLITE_CHECKED_VERSION
+#error "engine/sqlite_btree.c was checked against another SQLite version: check the internals named at its top against this one first (cmake/SqliteAmalgamation.cmake)"
 #endif
 
 #include "engine/sqlite_btree.h"
@@ -476,7 +476,7 @@ KOVSQ_INLINE int compareCell(BtCursor *cur, int idx, const u8 *key, u32 keySize,
 }
 
 /* The search of an index tree for a key, with the comparison above; the
- * same descent as sqlite3BtreeIndexMoveto (3.40.1), whose comparison of a
+ * same descent as sqlite3BtreeIndexMoveto, whose comparison of a
  * BLOB field is its general one: a quarter of a seek's time went there, and
  * the seeks of 16-byte keys among 100 000 (bench/run_peers.py, W5) take about
  * a fifth less time with this one. *cmp as for
