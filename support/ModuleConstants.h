@@ -2,10 +2,12 @@
 // literals: nothing is built, allocated or registered for them when the
 // library loads, and nothing needs tearing down when it unloads.
 //
-// Only the path separator is read inside the library (directory listing and
-// directory copying put it between a directory and an entry name). The
-// other names are part of the family of programs this library ships with;
-// they are kept here so every program names them alike.
+// Only the path separator is read inside the library: the path text rules
+// (support/NativePath.cpp, separator()) take it as the separator of Windows
+// paths, where they split a path into its parts, join a directory and an
+// entry name, and recognise a network prefix. The other names are part of
+// the family of programs this library ships with; they are kept here so every
+// program names them alike.
 #ifndef KOVPAGER_SUPPORT_MODULECONSTANTS_H
 #define KOVPAGER_SUPPORT_MODULECONSTANTS_H
 
@@ -50,8 +52,8 @@ constexpr std::string_view kWbXlatSuccessful = "KOVWB_XlatSuccessful";
 constexpr std::string_view kDatasourcesFolder = "My KOV Datasources";
 constexpr std::string_view kDatasourcesSubfolder = "datasources";
 
-// The separator put between a directory path and an entry name (or "*")
-// when a directory is listed or copied: a backslash in native Windows form.
+// The separator of Windows paths (POSIX paths use '/'), read through
+// kov::path::separator().
 constexpr std::string_view kPathSeparator = "\\";
 
 }  // namespace kov::constants

@@ -167,8 +167,8 @@ TEST_F(CallOrder, CopyTakenBeforeResetAssignedBackAfterANewEngine) {
 }
 
 // A copy taken while the store was closed holds no engine; assigned back over an open engine it
-// closes the store, as the description says (the engine is the copy's), and the engine that no
-// pager holds any more is closed rather than lost.
+// closes the store (the pager takes the copy's engine handle, which is none), and the engine that
+// no pager holds any more is closed rather than lost.
 TEST_F(CallOrder, CopyTakenWhileClosedAssignedBackOverAnOpenEngine) {
     KovPager::instance()->reset();
     PagerCopy closed;

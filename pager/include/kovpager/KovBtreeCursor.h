@@ -126,6 +126,10 @@ class KOVPAGER_EXPORT KovBtreeCursor {
     // true; false, on no entry, when every key is smaller. True says nothing about whether the
     // entry begins with `key`: ask indexKeyFetch.
     // REQUIRES: a BlobTable or an IndexTable.
+    // A search the store refuses (a null `key`, or one longer than a key can be) does not move
+    // the cursor, and the step that follows a search that stopped below the key is made from
+    // where the cursor stood: it goes to the next entry and returns true, or returns false when
+    // there is none (then on no entry). On an IntKeyTable, `size` is taken as the integer key.
     bool indexKeySeek(const void* key, std::uint64_t size);
 
     // True when the current key begins with the `prefixSize` bytes at `prefix`; `payload` is then
