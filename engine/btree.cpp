@@ -49,6 +49,7 @@
 
 #include "engine/btree.h"
 
+#include <atomic>
 #include <cassert>
 #include <cstdint>
 #include <cstring>
@@ -631,6 +632,23 @@ char*& temporaryDirectorySetting() { return *kovsq_temp_directory(); }
 
 sqlite3* TEST_connection(Btree* p) { return p == nullptr ? nullptr : p->db; }
 
+std::int64_t TEST_pragmaValue(Btree* p, const char* pragma) {
+    sqlite3_stmt* stmt = nullptr;
+    std::int64_t value = -1;
+    if (p != nullptr && sqlite3_prepare_v2(p->db, pragma, -1, &stmt, nullptr) == SQLITE_OK &&
+        sqlite3_step(stmt) == SQLITE_ROW) {
+        value = sqlite3_column_int64(stmt, 0);
+    }
+    sqlite3_finalize(stmt);
+    return value;
+}
+
+namespace {
+std::atomic<std::uint64_t> gEnginesOpened{0};
+}  // namespace
+
+std::uint64_t TEST_enginesOpened() { return gEnginesOpened.load(); }
+
 int sqlite3BtreeOpen(const char* filename, sqlite3* db, Btree** ppBtree, int flags) {
     if (ppBtree == nullptr)
         return SQLITE_MISUSE;
@@ -662,6 +680,7 @@ int sqlite3BtreeOpen(const char* filename, sqlite3* db, Btree** ppBtree, int fla
     bt->nextOpen = gOpenEngines;
     gOpenEngines = bt.get();
     *ppBtree = bt.release();
+    ++gEnginesOpened;
     return SQLITE_OK;
 }
 

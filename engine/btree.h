@@ -307,6 +307,13 @@ LoadStats TEST_loadStats(Btree* p);
 // null handle), so tests can look at its settings and its file.
 sqlite3* TEST_connection(Btree* p);
 
+// Test seam: the value of a setting of the engine's connection (`pragma` is "PRAGMA cache_size",
+// ...); -1 when it cannot be read.
+std::int64_t TEST_pragmaValue(Btree* p, const char* pragma);
+
+// Test seam: how many engines sqlite3BtreeOpen has opened in this process.
+std::uint64_t TEST_enginesOpened();
+
 }  // namespace kov::engine
 
 #endif  // KOVPAGER_ENGINE_BTREE_H

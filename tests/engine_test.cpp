@@ -88,14 +88,19 @@ TEST(EngineOpen, StoreSettingsSucceed) {
     EXPECT_EQ(engine.close(), SQLITE_OK);
 }
 
+// Counts below 10 pages are taken as 10; others as they are.
 TEST(EngineOpen, CacheSizeAcceptsSmallAndLargeCounts) {
     TestEngine engine;
     ASSERT_NE(engine.get(), nullptr);
     EXPECT_EQ(sqlite3BtreeSetCacheSize(engine.get(), 0), SQLITE_OK);
+    EXPECT_EQ(TEST_pragmaValue(engine.get(), "PRAGMA cache_size"), 10);
     EXPECT_EQ(sqlite3BtreeSetCacheSize(engine.get(), 5), SQLITE_OK);
+    EXPECT_EQ(TEST_pragmaValue(engine.get(), "PRAGMA cache_size"), 10);
     EXPECT_EQ(sqlite3BtreeSetCacheSize(engine.get(), 16384), SQLITE_OK);
+    EXPECT_EQ(TEST_pragmaValue(engine.get(), "PRAGMA cache_size"), 16384);
     // The engine keeps working with the smallest cache.
     EXPECT_EQ(sqlite3BtreeSetCacheSize(engine.get(), 1), SQLITE_OK);
+    EXPECT_EQ(TEST_pragmaValue(engine.get(), "PRAGMA cache_size"), 10);
     std::uint32_t root = engine.createTable(kIntTable);
     ASSERT_NE(root, 0u);
     TestCursor cur(engine.get(), root, 1);

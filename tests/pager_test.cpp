@@ -22,15 +22,7 @@ using namespace kovtest;
 namespace {
 
 std::int64_t pragmaValue(const char* pragma) {
-    sqlite3* db = kov::engine::TEST_connection(KovTestAccess::engine());
-    sqlite3_stmt* stmt = nullptr;
-    std::int64_t value = -1;
-    if (sqlite3_prepare_v2(db, pragma, -1, &stmt, nullptr) == SQLITE_OK &&
-        sqlite3_step(stmt) == SQLITE_ROW) {
-        value = sqlite3_column_int64(stmt, 0);
-    }
-    sqlite3_finalize(stmt);
-    return value;
+    return kov::engine::TEST_pragmaValue(KovTestAccess::engine(), pragma);
 }
 
 std::string bytes8(std::int64_t v) {
@@ -45,6 +37,10 @@ std::string bytes8(std::int64_t v) {
 // Pager and registry
 
 TEST(Pager, InstanceFromTwoThreadsIsOnePagerWithOneEngine) {
+    // Run first in its process (as ctest runs it), the two calls construct the pager, which opens
+    // its engine: exactly one engine between them. Run after other tests in the same process,
+    // the pager exists already and neither call opens one.
+    const std::uint64_t openedBefore = kov::engine::TEST_enginesOpened();
     std::atomic<bool> go{false};
     KovPager* seen[2] = {nullptr, nullptr};
     std::thread a([&] {
@@ -63,8 +59,8 @@ TEST(Pager, InstanceFromTwoThreadsIsOnePagerWithOneEngine) {
     ASSERT_NE(seen[0], nullptr);
     EXPECT_EQ(seen[0], seen[1]);
     EXPECT_EQ(seen[0], KovPager::instance());
-    // Run first in its process (as ctest runs it), the construction opened the engine; after an
-    // earlier test's reset, the next table opens it.
+    EXPECT_EQ(kov::engine::TEST_enginesOpened() - openedBefore, openedBefore == 0 ? 1u : 0u);
+    // After an earlier test's reset, the next table opens the engine.
     KovBtree table(KovBtree::IntKeyTable);
     EXPECT_NE(KovTestAccess::engine(), nullptr);
 }
