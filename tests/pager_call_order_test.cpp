@@ -17,22 +17,6 @@ using namespace kovtest;
 
 namespace {
 
-// A copy of the process's pager in storage of the test's own (a copy's destructor is private;
-// KovTestAccess runs it without touching the engine the copy shares).
-class PagerCopy {
-  public:
-    PagerCopy() : pager_(new (storage_) KovPager(*KovPager::instance())) {}
-    ~PagerCopy() { KovTestAccess::disposeCopy(pager_); }
-    PagerCopy(const PagerCopy&) = delete;
-    PagerCopy& operator=(const PagerCopy&) = delete;
-    KovPager& operator*() { return *pager_; }
-    KovPager* operator->() { return pager_; }
-
-  private:
-    alignas(KovPager) unsigned char storage_[sizeof(KovPager)];
-    KovPager* pager_;
-};
-
 bool engineOpen() { return kov::engine::sqlite3BtreeIsOpen(KovTestAccess::engine()); }
 
 // No two slots name the same engine cursor (each would close it).

@@ -3,9 +3,12 @@
 #include <gtest/gtest.h>
 
 #include <cstdint>
+#include <memory>
 #include <random>
+#include <string>
 #include <vector>
 
+#include "pager_test_util.h"
 #include "store_program.h"
 
 // The store fuzz target's check (tests/fuzz/store_fuzz.cpp) on fixed inputs: byte programs of
@@ -75,11 +78,31 @@ TEST(StoreFuzz, StoreDegenerateByteProgramsEndCleanly) {
 // position by the model's key form: a byte-string key of the size the engine reported, which on
 // a table of integer keys at that root is the integer key itself, and the program asked for a
 // string of that many bytes. It now reads the key in place, and only from a byte-string table.
+// Step by step: the same calls, with an integer key of 2^40 under the writer, and what the reader
+// (whose slot the copy's registry gave to the writer) answers after the creation.
 TEST(StoreFuzz, RegressionPositionTakenAfterACopyWasAssignedBack) {
-    const std::vector<std::uint8_t> bytes = {0x14, 0xf1, 0x19, 0xea, 0x1b, 0x19, 0x13, 0xff, 0x66, 0xcb, 0xea, 0x01, 0x1b, 0xdf, 0xb3, 0xd0, 0x76, 0xac, 0x0e, 0x8f, 0x53, 0xa7, 0x35, 0x06, 0x4b, 0xb3, 0xb7, 0xbb, 0x98, 0x44, 0x66, 0xcb};
-    kovtest::ByteChoices choices(bytes.data() + 1, bytes.size() - 1);
-    kovtest::StoreProgram program(choices, kovtest::fuzzVariant(bytes[0]));
-    program.run(1000);
-    EXPECT_GT(program.operations(), 8u);
-    EXPECT_EQ(program.mismatches(), 0u) << program.firstMismatch();
+    KovPager::instance()->reset();
+    auto first = std::make_unique<KovBtree>(KovBtree::BlobTable);
+    {
+        kovtest::PagerCopy copy;  // no cursor in its registry
+        auto reader = std::make_unique<KovBtreeCursor>(*first, false);
+        ASSERT_EQ(KovTestAccess::slotIndex(*reader), 0u);
+        KovBtree second(KovBtree::IntKeyTable);
+        *KovPager::instance() = *copy;  // the reader's slot is gone from the registry
+        EXPECT_TRUE(KovTestAccess::slots().empty());
+        first.reset();
+        KovBtreeCursor writer(second, true);
+        ASSERT_EQ(KovTestAccess::slotIndex(writer), 0u);  // the reader's index, now the writer's
+        kovtest::insertInt(writer, std::int64_t{1} << 40, "x");
+        ASSERT_EQ(writer.seek(std::int64_t{1} << 40), 0);
+        KovBtree third(KovBtree::IndexTable);  // reopens the slot on the integer table
+        ASSERT_TRUE(reader->good());
+        std::string payload = "old";
+        EXPECT_FALSE(reader->indexKeyFetch("", 0, payload));  // no byte key to fetch
+        EXPECT_EQ(payload, "old");
+        EXPECT_TRUE(reader->keyView().empty());
+        EXPECT_EQ(kovtest::intKey(writer), std::int64_t{1} << 40);
+        reader.reset();  // its slot index is the writer's: the writer's cursor goes with it
+    }
+    EXPECT_FALSE(KovPager::instance()->failed());
 }

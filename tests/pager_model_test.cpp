@@ -9,6 +9,7 @@
 #include <cstdio>
 #include <cstdlib>
 #include <string>
+#include <vector>
 
 #include "pager_test_util.h"
 #include "store_program.h"
@@ -88,9 +89,53 @@ TEST(PagerModel, RandomProgramsWithPagerCopiesRunClean) {
 
 // A program of seed 1 was the first to find the engine answering a second search on a cursor
 // with a refusal instead of a position (a search while the cursor stood on a row of the same
-// search); it stays as a quick check of its own.
+// search). Step by step, on each kind of table: a search, the same search from where it left the
+// cursor, a search for a key between two (landing on the larger), the same again, and an insert
+// of that key through the cursor the search left next to its place.
 TEST(PagerModel, RegressionSeed1SearchWhileOnASearchResult) {
-    runSeed(1);
+    KovPager::instance()->reset();
+    {
+        KovBtree table(KovBtree::IntKeyTable);
+        KovBtreeCursor c(table, true);
+        for (std::int64_t k : {10, 20, 30})
+            kovtest::insertInt(c, k, "d" + std::to_string(k));
+        for (int again = 0; again < 2; ++again) {
+            EXPECT_EQ(c.seek(std::int64_t{20}), 0) << again;
+            ASSERT_TRUE(c.good());
+            EXPECT_EQ(kovtest::intKey(c), 20);
+        }
+        for (int again = 0; again < 2; ++again) {
+            EXPECT_GT(c.seek(std::int64_t{15}), 0) << again;
+            ASSERT_TRUE(c.good());
+            EXPECT_EQ(kovtest::intKey(c), 20);
+        }
+        kovtest::insertInt(c, 15, "d15");
+        std::vector<std::int64_t> keys;
+        for (const auto& row : kovtest::walkInts(c))
+            keys.push_back(row.first);
+        EXPECT_EQ(keys, (std::vector<std::int64_t>{10, 15, 20, 30}));
+    }
+    for (KovBtree::TableType kind : {KovBtree::BlobTable, KovBtree::IndexTable}) {
+        KovBtree table(kind);
+        KovBtreeCursor c(table, true);
+        for (const char* k : {"b", "d", "f"})
+            kovtest::insertBytes(c, k, "data");
+        for (int again = 0; again < 2; ++again) {
+            EXPECT_EQ(kovtest::seekBytes(c, "d"), 0) << again;
+            ASSERT_TRUE(c.good());
+            EXPECT_EQ(kovtest::byteKey(c), "d");
+        }
+        for (int again = 0; again < 2; ++again) {
+            EXPECT_GT(kovtest::seekBytes(c, "c"), 0) << again;
+            ASSERT_TRUE(c.good());
+            EXPECT_EQ(kovtest::byteKey(c), "d");
+        }
+        kovtest::insertBytes(c, "c", "data");
+        std::vector<std::string> keys;
+        for (const auto& row : kovtest::walkBytes(c))
+            keys.push_back(row.first);
+        EXPECT_EQ(keys, (std::vector<std::string>{"b", "c", "d", "f"})) << kind;
+    }
 }
 
 // Tiny loads (a buffer of about 1 KiB, gathered from the second insert after a read): inserts are

@@ -7,6 +7,7 @@
 
 #include <cstdint>
 #include <cstring>
+#include <new>
 #include <string>
 #include <utility>
 #include <vector>
@@ -105,6 +106,22 @@ class StoreTest : public ::testing::Test {
         ASSERT_NE(KovTestAccess::engine(), nullptr);
     }
     void TearDown() override { EXPECT_TRUE(KovTestAccess::slots().empty()); }
+};
+
+// A copy of the process's pager in storage of the test's own (a copy's destructor is private;
+// KovTestAccess runs it without touching the engine the copy shares).
+class PagerCopy {
+  public:
+    PagerCopy() : pager_(new (storage_) KovPager(*KovPager::instance())) {}
+    ~PagerCopy() { KovTestAccess::disposeCopy(pager_); }
+    PagerCopy(const PagerCopy&) = delete;
+    PagerCopy& operator=(const PagerCopy&) = delete;
+    KovPager& operator*() { return *pager_; }
+    KovPager* operator->() { return pager_; }
+
+  private:
+    alignas(KovPager) unsigned char storage_[sizeof(KovPager)];
+    KovPager* pager_;
 };
 
 inline bool contains(const std::string& text, const std::string& part) {
