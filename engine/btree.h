@@ -4,7 +4,7 @@
 // SQLite B-trees (engine/sqlite_btree.h says how entries are laid out).
 //
 // What this layer promises (each rule has its own test in
-// tests/engine_test.cpp):
+// tests/engine/engine_test.cpp):
 //
 //  1. Key order. Byte-string keys compare bytewise unsigned over the shorter
 //     length, then the shorter key first. Integer keys compare as signed

@@ -1,5 +1,5 @@
 // Fuzz target for the store's three classes. The input is a program of host actions (see
-// tests/store_program.h): the first byte chooses the variant, every later byte feeds the choices
+// tests/lib/store_program.h): the first byte chooses the variant, every later byte feeds the choices
 // of the program (table creation of every kind, out-of-range kinds included; read and writing
 // cursors; every cursor operation with matching and mismatching key forms; table creation with
 // cursors open; reset; destruction of cursors and tables in any order; copies of the pager taken,

@@ -1,4 +1,4 @@
-// Soak run of the store: the model-based store program (tests/store_program.h) over and over,
+// Soak run of the store: the model-based store program (tests/lib/store_program.h) over and over,
 // each run with a randomly chosen I/O fault (a failed read or write, a temporary file that cannot
 // be created, a full disk; once or for a while) armed at a random point, until the time is up.
 //

@@ -12,7 +12,10 @@
 
 using namespace kovtest;
 
-TEST_F(StoreTest, TemporaryDirectoryThatCannotTakeAFile) {
+// The store reset, with no cursor left (StoreTest), for each test of this file.
+class PagerFailurePosix : public kovtest::StoreTest {};
+
+TEST_F(PagerFailurePosix, TemporaryDirectoryThatCannotTakeAFile) {
     {
         // Inserts straight into the B-tree: each one meets the missing file itself.
         kov::engine::test::ScopedLoadLimits straight{kov::engine::test::kStraightLoads};

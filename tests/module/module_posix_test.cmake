@@ -2,11 +2,11 @@
 # and counts its own atexit calls through a link-time wrapper) this builds:
 #   module_host    a host program that reaches the shared library only through dlopen;
 #   module_plugin  a loadable module that links the shared library and fills the store.
-add_executable(module_host "${CMAKE_CURRENT_SOURCE_DIR}/module_host.cpp")
-target_link_libraries(module_host PRIVATE ${CMAKE_DL_LIBS})
+add_executable(module_host "${CMAKE_CURRENT_SOURCE_DIR}/hosts/module_host.cpp")
+target_link_libraries(module_host PRIVATE kovpager_test_headers ${CMAKE_DL_LIBS})
 kovpager_warnings(module_host)
 
-add_library(module_plugin MODULE "${CMAKE_CURRENT_SOURCE_DIR}/module_plugin.cpp")
+add_library(module_plugin MODULE "${CMAKE_CURRENT_SOURCE_DIR}/hosts/module_plugin.cpp")
 target_link_libraries(module_plugin PRIVATE kovpager)
 kovpager_warnings(module_plugin)
 

@@ -2,12 +2,13 @@
 #   dll_host_win32         a host program that reaches the DLL only through LoadLibrary;
 #   dll_host_win32_plugin  a DLL that links the store's DLL and fills the store.
 # The test program finds them, and the store's DLL, relative to its own directory.
-add_executable(dll_host_win32 "${CMAKE_CURRENT_SOURCE_DIR}/dll_host_win32.cpp")
-# support/Win32Api.h only: the host never links the store.
+add_executable(dll_host_win32 "${CMAKE_CURRENT_SOURCE_DIR}/hosts/dll_host_win32.cpp")
+# support/Win32Api.h and the tests' host helpers only: the host never links the store.
 target_include_directories(dll_host_win32 PRIVATE "${PROJECT_SOURCE_DIR}")
+target_link_libraries(dll_host_win32 PRIVATE kovpager_test_headers)
 kovpager_warnings(dll_host_win32)
 
-add_library(dll_host_win32_plugin MODULE "${CMAKE_CURRENT_SOURCE_DIR}/module_plugin.cpp")
+add_library(dll_host_win32_plugin MODULE "${CMAKE_CURRENT_SOURCE_DIR}/hosts/module_plugin.cpp")
 set_target_properties(dll_host_win32_plugin PROPERTIES PREFIX "")
 target_link_libraries(dll_host_win32_plugin PRIVATE kovpager)
 kovpager_warnings(dll_host_win32_plugin)
@@ -29,6 +30,6 @@ kov_discover_tests(${KOV_TEST} TIMEOUT 300)
 # The DLL exports the members of its three classes and nothing else: no
 # helper of ours, no standard-library instantiation, no SQLite.
 add_test(NAME Library.DllExportsOnlyTheThreeClasses
-  COMMAND sh "${CMAKE_CURRENT_SOURCE_DIR}/check_dll_exports.sh" "$<TARGET_FILE:kovpager>"
+  COMMAND sh "${CMAKE_CURRENT_SOURCE_DIR}/library/check_dll_exports.sh" "$<TARGET_FILE:kovpager>"
           "${CMAKE_OBJDUMP}")
 set_tests_properties(Library.DllExportsOnlyTheThreeClasses PROPERTIES LABELS "unit")

@@ -1,7 +1,7 @@
 // KovPager::failed() and failure(): a failure that loses or refuses data shows there, from the
 // operation that met it until reset(); the refusals the store makes by design do not. The I/O
 // faults (a failed read or write, a full disk, a temporary file refused) are injected in
-// tests/pager_fault_test.cpp; here: the store's own refusals, the engine that cannot be opened,
+// tests/pager/pager_fault_test.cpp; here: the store's own refusals, the engine that cannot be opened,
 // memory running out inside the engine, and a temporary directory that cannot take a file.
 #include <gtest/gtest.h>
 
@@ -56,13 +56,16 @@ void expectFreshStoreWorks() {
 
 }  // namespace
 
-TEST_F(StoreTest, NoFailureOnAFreshStore) {
+// The store reset, with no cursor left (StoreTest), for each test of this file.
+class PagerFailure : public kovtest::StoreTest {};
+
+TEST_F(PagerFailure, NoFailureOnAFreshStore) {
     EXPECT_FALSE(KovPager::instance()->failed());
     EXPECT_EQ(KovPager::instance()->failure(), "");
 }
 
 // Everything the store refuses by design leaves failed() false.
-TEST_F(StoreTest, RefusalsByDesignAreNotFailures) {
+TEST_F(PagerFailure, RefusalsByDesignAreNotFailures) {
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtree bytes(KovBtree::BlobTable);
     {
@@ -95,7 +98,7 @@ TEST_F(StoreTest, RefusalsByDesignAreNotFailures) {
 // The engine cannot be opened (its SQLite has no memory for the connection): failed() turns
 // true at the table construction that opened it, and failure() says so; the table is unusable
 // (root page 0). Later tables try again; reset() clears the failure.
-TEST_F(StoreTest, EngineThatCannotBeOpened) {
+TEST_F(PagerFailure, EngineThatCannotBeOpened) {
     KovPager::instance()->reset();
     std::unique_ptr<KovBtree> unusable;
     std::unique_ptr<KovBtreeCursor> c;
@@ -129,7 +132,7 @@ TEST_F(StoreTest, EngineThatCannotBeOpened) {
 // half-done, may leave the table being written damaged, as any failed insert can),
 // failed() turns true and failure() names the insert and the engine's message; every later
 // insert is refused, another table reads back whole, and reset() gives a working store again.
-TEST_F(StoreTest, OutOfMemoryInsideTheEngine) {
+TEST_F(PagerFailure, OutOfMemoryInsideTheEngine) {
     // Inserts straight into the B-tree: each one meets the memory cap itself.
     kov::engine::test::ScopedLoadLimits straight{kov::engine::test::kStraightLoads};
     KovPager::instance()->reset();
@@ -169,7 +172,7 @@ TEST_F(StoreTest, OutOfMemoryInsideTheEngine) {
 // The temporary directory removed after it was chosen, before the store wanted its file: the
 // insert that wanted it is refused and the host is told why and where (on every platform); what
 // the store held reads back; after reset() a store that needs no file works.
-TEST_F(StoreTest, TemporaryDirectoryRemovedSinceItWasChosenIsTold) {
+TEST_F(PagerFailure, TemporaryDirectoryRemovedSinceItWasChosenIsTold) {
     const std::string gone = kov::test::vanishedDirectory("kov-gone-");
     ASSERT_FALSE(gone.empty());
     {

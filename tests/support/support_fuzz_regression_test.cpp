@@ -8,7 +8,7 @@
 #include <string>
 #include <vector>
 
-#include "fuzz/text_rules_invariants.h"
+#include "text_rules_invariants.h"
 #include "support/NativePath.h"
 #include "tempdir/StripCharacters.h"
 

@@ -74,10 +74,13 @@ bool sanitized() {
 
 }  // namespace
 
+// The store reset, with no cursor left (StoreTest), for each test of this file.
+class PagerBadInput : public kovtest::StoreTest {};
+
 // Null pointers with size 0, on byte-string tables: a null key is not the empty key. seek and
 // insert refuse it (seek answers negative and leaves the cursor where it was; insert adds
 // nothing); a null data pointer with size 0 stores empty data; data(nullptr, 0) copies nothing.
-TEST_F(StoreTest, NullPointersWithSizeZero) {
+TEST_F(PagerBadInput, NullPointersWithSizeZero) {
     KovBtree blobs(KovBtree::BlobTable);
     KovBtreeCursor c(blobs, true);
     insertBytes(c, "k", "v");
@@ -129,7 +132,7 @@ TEST_F(StoreTest, NullPointersWithSizeZero) {
 
 // Read sizes above 32 bits: only the low 32 bits reach the engine. A size of 2^32 + n copies n
 // bytes; 2^32 copies nothing.
-TEST_F(StoreTest, ReadSizesUseTheirLow32Bits) {
+TEST_F(PagerBadInput, ReadSizesUseTheirLow32Bits) {
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtreeCursor c(ints, true);
     insertInt(c, 1, "abcdef");
@@ -149,7 +152,7 @@ TEST_F(StoreTest, ReadSizesUseTheirLow32Bits) {
 // refused before the buffer is read: no entry, no partial entry. Lengths from 10^9 to 2^31 - 1
 // are above the engine's limit and refused the same way. A size of 2^32 or more is cut to its
 // low 32 bits: 2^32 + 3 stores the first 3 bytes.
-TEST_F(StoreTest, HugeDataSizesAreRefusedOrCutToTheirLow32Bits) {
+TEST_F(PagerBadInput, HugeDataSizesAreRefusedOrCutToTheirLow32Bits) {
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtreeCursor c(ints, true);
     const char small[4] = {'x', 'y', 'z', 'w'};
@@ -183,7 +186,7 @@ TEST_F(StoreTest, HugeDataSizesAreRefusedOrCutToTheirLow32Bits) {
 
 // Kinds other than 0 and 1, whatever their value, make key-only tables: the data of a
 // key-and-data insert is not kept, and dataSize() reads 0.
-TEST_F(StoreTest, OutOfRangeKindsMakeKeyOnlyTables) {
+TEST_F(PagerBadInput, OutOfRangeKindsMakeKeyOnlyTables) {
     for (std::int32_t kind : {2, 3, -1, 255, INT32_MIN, INT32_MAX}) {
         SCOPED_TRACE(kind);
         KovBtree t(static_cast<KovBtree::TableType>(kind));
@@ -203,7 +206,7 @@ TEST_F(StoreTest, OutOfRangeKindsMakeKeyOnlyTables) {
 // The byte-string insert and seek forms on an integer table use the byte count as the integer
 // key (the engine ignores the pointer there); the integer forms on a byte-string table are
 // refused. The same holds for indexKeySeek; indexKeyFetch on an integer table is false.
-TEST_F(StoreTest, ByteFormsOnAnIntegerTableUseTheLengthAsTheKey) {
+TEST_F(PagerBadInput, ByteFormsOnAnIntegerTableUseTheLengthAsTheKey) {
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtreeCursor c(ints, true);
     c.insert("abc", 3, "data", 4);
@@ -223,7 +226,7 @@ TEST_F(StoreTest, ByteFormsOnAnIntegerTableUseTheLengthAsTheKey) {
 
 // A cursor destroyed after its table: the table was not dropped (a cursor was open) and the
 // cursor's destruction frees its slot as usual; the store goes on working.
-TEST_F(StoreTest, CursorDestroyedAfterItsTable) {
+TEST_F(PagerBadInput, CursorDestroyedAfterItsTable) {
     auto table = std::make_unique<KovBtree>(KovBtree::BlobTable);
     auto cursor = std::make_unique<KovBtreeCursor>(*table, true);
     insertBytes(*cursor, "k", "v");
@@ -242,7 +245,7 @@ TEST_F(StoreTest, CursorDestroyedAfterItsTable) {
 // A cursor destroyed after reset leaves its slot live (the engine is closed); the next table
 // creation reopens it in the fresh engine, where it reads the new table of that root page, if
 // any. The slot is freed at the exit-time teardown.
-TEST_F(StoreTest, CursorDestroyedAfterReset) {
+TEST_F(PagerBadInput, CursorDestroyedAfterReset) {
     auto table = std::make_unique<KovBtree>(KovBtree::BlobTable);
     auto cursor = std::make_unique<KovBtreeCursor>(*table, true);
     insertBytes(*cursor, "k", "v");
@@ -264,7 +267,7 @@ TEST_F(StoreTest, CursorDestroyedAfterReset) {
 }
 
 // Cursors and tables destroyed after the exit-time teardown find no engine and do nothing.
-TEST_F(StoreTest, CursorAndTableDestroyedAfterTheTeardown) {
+TEST_F(PagerBadInput, CursorAndTableDestroyedAfterTheTeardown) {
     auto table = std::make_unique<KovBtree>(KovBtree::IntKeyTable);
     auto writer = std::make_unique<KovBtreeCursor>(*table, true);
     auto reader = std::make_unique<KovBtreeCursor>(*table, false);
@@ -282,7 +285,7 @@ TEST_F(StoreTest, CursorAndTableDestroyedAfterTheTeardown) {
 
 // A writing cursor refused because a read cursor is open on its table answers "no entry" to
 // everything, adds nothing, and is destroyed like any other.
-TEST_F(StoreTest, RefusedWritingCursorDoesNothing) {
+TEST_F(PagerBadInput, RefusedWritingCursorDoesNothing) {
     KovBtree t(KovBtree::BlobTable);
     {
         KovBtreeCursor w(t, true);
@@ -318,7 +321,7 @@ TEST_F(StoreTest, RefusedWritingCursorDoesNothing) {
 // Assigning a copy taken before a table creation or a cursor's destruction would bring back
 // engine cursors that were since freed: hosts must not do it (the library never copies the
 // pager).
-TEST_F(StoreTest, PagerCopiedAndAssignedBackWhileNothingChanged) {
+TEST_F(PagerBadInput, PagerCopiedAndAssignedBackWhileNothingChanged) {
     KovBtree t(KovBtree::IntKeyTable);
     KovBtreeCursor c(t, true);
     insertInt(c, 1, "one");
@@ -338,7 +341,7 @@ TEST_F(StoreTest, PagerCopiedAndAssignedBackWhileNothingChanged) {
 // reopens all of them, and each comes back on its entry. They are made as read cursors (a
 // writing cursor made while a read cursor is open on the table would be refused); each table
 // creation brings them back as writing cursors.
-TEST_F(StoreTest, AThousandCursorsAcrossAHundredTableCreations) {
+TEST_F(PagerBadInput, AThousandCursorsAcrossAHundredTableCreations) {
     std::vector<std::unique_ptr<KovBtree>> tables;
     std::vector<std::unique_ptr<KovBtreeCursor>> cursors;
     std::vector<std::int64_t> keys;
@@ -371,7 +374,7 @@ TEST_F(StoreTest, AThousandCursorsAcrossAHundredTableCreations) {
 
 // 100 000 tables made and destroyed one after the other, with no cursor open: each is dropped,
 // so neither memory nor the database grows with their number.
-TEST_F(StoreTest, AHundredThousandTablesMadeAndDestroyed) {
+TEST_F(PagerBadInput, AHundredThousandTablesMadeAndDestroyed) {
     const int count = sanitized() ? 20000 : 100000;
     // Warm up: the first tables settle the engine's bookkeeping and the free pages.
     for (int i = 0; i < 1000; ++i)

@@ -1,7 +1,7 @@
 #!/bin/sh
 # Fails when the shared library exports any dynamic symbol that is not a
 # member of KovPager, KovBtree or KovBtreeCursor (SQLite's included).
-#   tests/check_exports.sh <path to libkovpager.so>
+#   tests/library/check_exports.sh <path to libkovpager.so>
 set -eu
 . "$(dirname "$0")/exports_lib.sh"
 lib=$1

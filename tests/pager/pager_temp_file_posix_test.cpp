@@ -95,9 +95,12 @@ std::int64_t countEntries(KovBtreeCursor& c) {
 
 }  // namespace
 
+// The store reset, with no cursor left (StoreTest), for each test of this file.
+class PagerTempFile : public kovtest::StoreTest {};
+
 // Past a small cache the file exists: in the chosen directory and nowhere else, already unlinked
 // from it (the directory lists nothing), readable and writable by the process's user only.
-TEST_F(StoreTest, TemporaryFileIsMadeOnlyInTheChosenDirectoryForItsUserAlone) {
+TEST_F(PagerTempFile, TemporaryFileIsMadeOnlyInTheChosenDirectoryForItsUserAlone) {
     kov::test::ScratchDirectory scratch("kov-temp-file-");
     ASSERT_FALSE(scratch.path().empty());
     ASSERT_TRUE(storeFiles().empty());
@@ -130,7 +133,7 @@ TEST_F(StoreTest, TemporaryFileIsMadeOnlyInTheChosenDirectoryForItsUserAlone) {
 // directory without write permission otherwise): the insert that needed the file is refused and
 // the host is told why and where; no file of the store's is made in any other directory; every
 // entry inserted before reads back; reset() gives a store that works while it needs no file.
-TEST_F(StoreTest, ReadOnlyTemporaryDirectoryIsToldAndNothingIsMadeElsewhere) {
+TEST_F(PagerTempFile, ReadOnlyTemporaryDirectoryIsToldAndNothingIsMadeElsewhere) {
     SmallFileSystem readOnly("size=1m", true);
     kov::test::ScratchDirectory fallback("kov-no-write-");
     std::string dir = readOnly.path();
@@ -271,8 +274,8 @@ void fillASmallFileSystem(int cachePages) {
 // With the store's own 64 MiB cache: the file is wanted, and room for what the cache holds asked
 // for, once the store could outgrow half its cache; 24 MiB cannot hold that, so the insert that
 // wanted it is refused and everything stays in the cache, readable.
-TEST_F(StoreTest, FullSmallFileSystemLosesNothing) { fillASmallFileSystem(0); }
+TEST_F(PagerTempFile, FullSmallFileSystemLosesNothing) { fillASmallFileSystem(0); }
 
 // With a cache of 100 pages: the pages go through the file, which fills the file system, with
 // loads gathered, written in runs and merged on the way.
-TEST_F(StoreTest, FullSmallFileSystemLosesNothingPastASmallCache) { fillASmallFileSystem(100); }
+TEST_F(PagerTempFile, FullSmallFileSystemLosesNothingPastASmallCache) { fillASmallFileSystem(100); }

@@ -7,7 +7,7 @@
 //     harm, and a new table reopens the engine;
 //   - a first construction that throws registers nothing, and the next call constructs.
 //
-// The library cases run module_host (tests/module_host.cpp), which reaches the library only
+// The library cases run module_host (tests/hosts/module_host.cpp), which reaches the library only
 // through dlopen. The pager cases fork this program, which links the store statically; its calls
 // of atexit are counted by a link-time wrapper (module_posix_test.cmake wraps the symbol).
 #include <gtest/gtest.h>

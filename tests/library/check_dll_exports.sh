@@ -2,7 +2,7 @@
 # Fails when the DLL exports any name that is not a member of KovPager,
 # KovBtree or KovBtreeCursor, or any name of the engine (sqlite3_*, the
 # library's renamed kovpager_sqlite3_*, kovsq_*).
-#   tests/check_dll_exports.sh <path to libkovpager.dll> [objdump]
+#   tests/library/check_dll_exports.sh <path to libkovpager.dll> [objdump]
 # objdump defaults to x86_64-w64-mingw32-objdump; the demangler is the
 # c++filt beside it (x86_64-w64-mingw32-c++filt), else the host's c++filt.
 set -eu

@@ -81,7 +81,10 @@ TEST(Pager, EngineDirectorySettingIsThePagersOwnCopy) {
     EXPECT_EQ(kov::engine::temporaryDirectorySetting(), dir.c_str());
 }
 
-TEST_F(StoreTest, CloseAllOnEmptyRegistryEmptiesSavedAndRestoreDoesNothing) {
+// The store reset, with no cursor left (StoreTest), for each test of this file.
+class PagerStore : public kovtest::StoreTest {};
+
+TEST_F(PagerStore, CloseAllOnEmptyRegistryEmptiesSavedAndRestoreDoesNothing) {
     std::vector<std::string> saved{"left", "over"};
     KovTestAccess::closeAllCursors(saved);
     EXPECT_TRUE(saved.empty());
@@ -89,7 +92,7 @@ TEST_F(StoreTest, CloseAllOnEmptyRegistryEmptiesSavedAndRestoreDoesNothing) {
     EXPECT_TRUE(KovTestAccess::slots().empty());
 }
 
-TEST_F(StoreTest, UnpositionedAndPastEndCursorsAreSavedAsZeroOrEmptyKey) {
+TEST_F(PagerStore, UnpositionedAndPastEndCursorsAreSavedAsZeroOrEmptyKey) {
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtree blobs(KovBtree::BlobTable);
     KovBtreeCursor wi(ints, true);
@@ -120,7 +123,7 @@ TEST_F(StoreTest, UnpositionedAndPastEndCursorsAreSavedAsZeroOrEmptyKey) {
     EXPECT_EQ(byteKey(pastEndBytes), "m");
 }
 
-TEST_F(StoreTest, PastEndCursorReportsAnEntryAfterATableIsCreated) {
+TEST_F(PagerStore, PastEndCursorReportsAnEntryAfterATableIsCreated) {
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtreeCursor c(ints, true);
     insertInt(c, 3, "x");
@@ -132,7 +135,7 @@ TEST_F(StoreTest, PastEndCursorReportsAnEntryAfterATableIsCreated) {
     EXPECT_EQ(intKey(c), 3);
 }
 
-TEST_F(StoreTest, IntegerCursorOnMinusOneIsSavedAsAllOnesAndComesBack) {
+TEST_F(PagerStore, IntegerCursorOnMinusOneIsSavedAsAllOnesAndComesBack) {
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtreeCursor c(ints, true);
     insertInt(c, -1, "minus one");
@@ -150,7 +153,7 @@ TEST_F(StoreTest, IntegerCursorOnMinusOneIsSavedAsAllOnesAndComesBack) {
     EXPECT_EQ(dataOf(c), "minus one");
 }
 
-TEST_F(StoreTest, ByteCursorComesBackOnItsKeyShortOrLong) {
+TEST_F(PagerStore, ByteCursorComesBackOnItsKeyShortOrLong) {
     KovBtree blobs(KovBtree::BlobTable);
     KovBtreeCursor w(blobs, true);
     const std::string shortKey = "fifteen bytes!!";  // 15 bytes
@@ -174,7 +177,7 @@ TEST_F(StoreTest, ByteCursorComesBackOnItsKeyShortOrLong) {
     EXPECT_EQ(dataOf(b), "l");
 }
 
-TEST_F(StoreTest, ReadCursorComesBackAsWritingCursorAfterTableCreation) {
+TEST_F(PagerStore, ReadCursorComesBackAsWritingCursorAfterTableCreation) {
     KovBtree t(KovBtree::IntKeyTable);
     KovBtreeCursor reader(t, false);
     {
@@ -195,7 +198,7 @@ TEST_F(StoreTest, ReadCursorComesBackAsWritingCursorAfterTableCreation) {
     EXPECT_EQ(dataOf(writer), "through the old reader");
 }
 
-TEST_F(StoreTest, FreeSlotsKeepTheirPlacesUntilTheyTrail) {
+TEST_F(PagerStore, FreeSlotsKeepTheirPlacesUntilTheyTrail) {
     KovBtree t(KovBtree::BlobTable);
     auto a = std::make_unique<KovBtreeCursor>(t, true);
     auto b = std::make_unique<KovBtreeCursor>(t, true);
@@ -222,7 +225,7 @@ TEST_F(StoreTest, FreeSlotsKeepTheirPlacesUntilTheyTrail) {
     EXPECT_TRUE(KovTestAccess::slots().empty());
 }
 
-TEST_F(StoreTest, SlotCopiesRootPageAndFlagsOfItsTable) {
+TEST_F(PagerStore, SlotCopiesRootPageAndFlagsOfItsTable) {
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtree blobs(KovBtree::BlobTable);
     KovBtree index(KovBtree::IndexTable);
@@ -238,7 +241,7 @@ TEST_F(StoreTest, SlotCopiesRootPageAndFlagsOfItsTable) {
     EXPECT_NE(KovTestAccess::rootPage(ints), KovTestAccess::rootPage(blobs));
 }
 
-TEST_F(StoreTest, ResetTwiceInARowDoesNothingMore) {
+TEST_F(PagerStore, ResetTwiceInARowDoesNothingMore) {
     KovBtree t(KovBtree::BlobTable);
     KovPager::instance()->reset();
     EXPECT_EQ(KovTestAccess::engine(), nullptr);
@@ -249,7 +252,7 @@ TEST_F(StoreTest, ResetTwiceInARowDoesNothingMore) {
     EXPECT_TRUE(KovTestAccess::slots().empty());
 }
 
-TEST_F(StoreTest, CopyAndAssignmentKeepTheEngineDirectorySettingValid) {
+TEST_F(PagerStore, CopyAndAssignmentKeepTheEngineDirectorySettingValid) {
     KovPager* pager = KovPager::instance();
     const std::string original = KovTestAccess::tempDir(pager);
     KovBtree t(KovBtree::IntKeyTable);
@@ -291,7 +294,7 @@ TEST_F(StoreTest, CopyAndAssignmentKeepTheEngineDirectorySettingValid) {
 // ---------------------------------------------------------------------------------------------
 // Tables
 
-TEST_F(StoreTest, CreatingATableKeepsOpenCursorsOnTheirEntries) {
+TEST_F(PagerStore, CreatingATableKeepsOpenCursorsOnTheirEntries) {
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtree blobs(KovBtree::BlobTable);
     KovBtree index(KovBtree::IndexTable);
@@ -328,7 +331,7 @@ TEST_F(StoreTest, CreatingATableKeepsOpenCursorsOnTheirEntries) {
     EXPECT_EQ(byteKey(cx), "ix41");
 }
 
-TEST_F(StoreTest, CreatingATableAfterResetOpensAFreshEngine) {
+TEST_F(PagerStore, CreatingATableAfterResetOpensAFreshEngine) {
     std::uint32_t firstRoot = 0;
     {
         KovPager::instance()->reset();
@@ -347,7 +350,7 @@ TEST_F(StoreTest, CreatingATableAfterResetOpensAFreshEngine) {
     EXPECT_FALSE(c.first());
 }
 
-TEST_F(StoreTest, KindsOtherThanZeroAndOneMakeKeyOnlyTables) {
+TEST_F(PagerStore, KindsOtherThanZeroAndOneMakeKeyOnlyTables) {
     for (std::int32_t kind : {2, 3, -1, 1000}) {
         KovBtree t(static_cast<KovBtree::TableType>(kind));
         KovBtreeCursor c(t, true);
@@ -359,7 +362,7 @@ TEST_F(StoreTest, KindsOtherThanZeroAndOneMakeKeyOnlyTables) {
     }
 }
 
-TEST_F(StoreTest, DestroyingATableWhileACursorIsOpenElsewhereKeepsIt) {
+TEST_F(PagerStore, DestroyingATableWhileACursorIsOpenElsewhereKeepsIt) {
     KovBtree holder(KovBtree::BlobTable);
     std::uint32_t keptRoot = 0;
     std::uint32_t nextRoot = 0;
@@ -384,7 +387,7 @@ TEST_F(StoreTest, DestroyingATableWhileACursorIsOpenElsewhereKeepsIt) {
     kov::engine::sqlite3BtreeCloseCursor(raw);
 }
 
-TEST_F(StoreTest, DestroyingATableWithNoCursorOpenDropsIt) {
+TEST_F(PagerStore, DestroyingATableWithNoCursorOpenDropsIt) {
     std::uint32_t root = 0;
     {
         KovBtree t(KovBtree::IntKeyTable);
@@ -401,7 +404,7 @@ TEST_F(StoreTest, DestroyingATableWithNoCursorOpenDropsIt) {
     EXPECT_FALSE(c.first());
 }
 
-TEST_F(StoreTest, DestroyingATableAfterResetDoesNothing) {
+TEST_F(PagerStore, DestroyingATableAfterResetDoesNothing) {
     {
         KovBtree t(KovBtree::IntKeyTable);
         KovPager::instance()->reset();
@@ -413,7 +416,7 @@ TEST_F(StoreTest, DestroyingATableAfterResetDoesNothing) {
 // ---------------------------------------------------------------------------------------------
 // Cursor operations specific to one kind
 
-TEST_F(StoreTest, IntegerKeyIsTheInsertedKeyAndByteKeyReportsItsLength) {
+TEST_F(PagerStore, IntegerKeyIsTheInsertedKeyAndByteKeyReportsItsLength) {
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtree blobs(KovBtree::BlobTable);
     KovBtreeCursor ci(ints, true);
@@ -426,7 +429,7 @@ TEST_F(StoreTest, IntegerKeyIsTheInsertedKeyAndByteKeyReportsItsLength) {
     EXPECT_EQ(intKey(cb), 7);
 }
 
-TEST_F(StoreTest, BufferReadsCopyExactlyWhatFitsAndNothingPastTheEntry) {
+TEST_F(PagerStore, BufferReadsCopyExactlyWhatFitsAndNothingPastTheEntry) {
     KovBtree blobs(KovBtree::BlobTable);
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtreeCursor cb(blobs, true);
@@ -458,7 +461,7 @@ TEST_F(StoreTest, BufferReadsCopyExactlyWhatFitsAndNothingPastTheEntry) {
     EXPECT_EQ(KovTestAccess::keySize(ci), 5);
 }
 
-TEST_F(StoreTest, EmptyKeyIsAnOrdinaryKey) {
+TEST_F(PagerStore, EmptyKeyIsAnOrdinaryKey) {
     KovBtree blobs(KovBtree::BlobTable);
     KovBtreeCursor c(blobs, true);
     insertBytes(c, "", "empty");
@@ -470,7 +473,7 @@ TEST_F(StoreTest, EmptyKeyIsAnOrdinaryKey) {
     EXPECT_EQ(byteKey(c), "a");
 }
 
-TEST_F(StoreTest, ByteKeysOrderUnsignedAndShorterFirst) {
+TEST_F(PagerStore, ByteKeysOrderUnsignedAndShorterFirst) {
     KovBtree blobs(KovBtree::BlobTable);
     KovBtreeCursor c(blobs, true);
     for (const char* k : {"b", "\xff", "ab", "a", "a\x01", "\x7f"})
@@ -481,7 +484,7 @@ TEST_F(StoreTest, ByteKeysOrderUnsignedAndShorterFirst) {
     EXPECT_EQ(keys, (std::vector<std::string>{"a", "a\x01", "ab", "b", "\x7f", "\xff"}));
 }
 
-TEST_F(StoreTest, IntegerKeysOrderSigned) {
+TEST_F(PagerStore, IntegerKeysOrderSigned) {
     KovBtree ints(KovBtree::IntKeyTable);
     KovBtreeCursor c(ints, true);
     for (std::int64_t k : {INT64_C(3), INT64_C(-1), INT64_MAX, INT64_MIN, INT64_C(0)}) {
@@ -493,7 +496,7 @@ TEST_F(StoreTest, IntegerKeysOrderSigned) {
     EXPECT_EQ(keys, (std::vector<std::int64_t>{INT64_MIN, -1, 0, 3, INT64_MAX}));
 }
 
-TEST_F(StoreTest, WrongKeyFormIsRefusedAndLeavesTheCursorInPlace) {
+TEST_F(PagerStore, WrongKeyFormIsRefusedAndLeavesTheCursorInPlace) {
     KovBtree blobs(KovBtree::BlobTable);
     KovBtreeCursor c(blobs, true);
     insertBytes(c, "k", "v");
@@ -604,7 +607,7 @@ TEST_F(IndexKeys, PublicFetchOnAnotherPrefixResizesAndPads) {
 // ---------------------------------------------------------------------------------------------
 // The typical use, start to end.
 
-TEST_F(StoreTest, TypicalUseInsertCreateAnotherTableThenWalk) {
+TEST_F(PagerStore, TypicalUseInsertCreateAnotherTableThenWalk) {
     KovBtree numbers(KovBtree::IntKeyTable);
     KovBtreeCursor writer(numbers, true);
     for (std::int64_t k = 1; k <= 1000; ++k)
