@@ -42,8 +42,11 @@ compile-windows: configure-windows
 	sh cmake/wine-run.sh --prefix=$(abspath $(WINDOWS_BUILD))/wineprefix --init
 	cmake --build $(WINDOWS_BUILD) -j $(JOBS)
 
+# A test that fails is run once more before it counts as failed: under Wine a test program now and
+# then fails to start at all (no output, a hundredth of a second, seen once in some twenty runs of
+# the suite); a test that really fails fails twice.
 test-windows: compile-windows
-	cd $(WINDOWS_BUILD) && ctest --output-on-failure -j $(JOBS) $(CTEST_ARGS)
+	cd $(WINDOWS_BUILD) && ctest --output-on-failure --repeat until-pass:2 -j $(JOBS) $(CTEST_ARGS)
 
 clean-windows:
 	rm -rf $(WINDOWS_BUILD)
