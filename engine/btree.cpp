@@ -97,10 +97,6 @@ constexpr bool sameCodes() {
 static_assert(sizeof kDeclaredCodes == sizeof kSqliteCodes && sameCodes(),
               "engine/btree.h declares a result code with another value than SQLite's");
 
-}  // namespace
-
-namespace {
-
 // Keys and data beyond SQLite's default length limit are refused.
 constexpr std::int64_t kMaxLength = 1000000000;
 

@@ -15,14 +15,14 @@ namespace kov::pager {
 namespace {
 
 // Makes `key` the size of the key a live slot's cursor stands on, and for an integer key stores
-// it: the part of closeAll that allocates. Returns the count of key bytes still to be read.
-std::uint32_t sizeKey(const CursorSlot& slot, std::string& key) {
+// it: the part of closeAll that allocates (a byte-string key's bytes are read afterwards).
+void sizeKey(const CursorSlot& slot, std::string& key) {
     std::int64_t size = 0;
     eng::sqlite3BtreeKeySize(slot.cursor, &size);
     if (CursorRegistry::hasIntegerKeys(slot)) {
         key.resize(sizeof size);
         std::memcpy(key.data(), &size, sizeof size);
-        return 0;
+        return;
     }
     // A slot registered before a reset may have been reopened on an integer-keyed table of the
     // new engine; its "size" is then an integer key. The engine refuses a byte read on such a
@@ -30,7 +30,6 @@ std::uint32_t sizeKey(const CursorSlot& slot, std::string& key) {
     if (size > 0 && eng::sqlite3BtreeKey(slot.cursor, 0, 0, nullptr) != eng::SQLITE_OK)
         size = 0;
     key.resize(size > 0 ? static_cast<std::size_t>(size) : 0);
-    return static_cast<std::uint32_t>(key.size());
 }
 
 // Reopens one slot as a writing cursor on its saved key.
@@ -119,17 +118,17 @@ void CursorRegistry::closeAll(Slots& slots, std::vector<std::string>& saved) {
     // Room for every key first (the allocations, which may throw: then no cursor is closed),
     // then each key read and its cursor closed (neither allocates).
     saved.resize(slots.size());
-    std::vector<std::uint32_t> toRead(slots.size(), 0);
     for (std::size_t i = 0; i < slots.size(); ++i) {
         if (!isFree(slots[i]))
-            toRead[i] = sizeKey(slots[i], saved[i]);
+            sizeKey(slots[i], saved[i]);
     }
     for (std::size_t i = 0; i < slots.size(); ++i) {
         CursorSlot& slot = slots[i];
         if (isFree(slot))
             continue;
-        if (toRead[i] > 0)
-            eng::sqlite3BtreeKey(slot.cursor, 0, toRead[i], saved[i].data());
+        if (!hasIntegerKeys(slot) && !saved[i].empty())
+            eng::sqlite3BtreeKey(slot.cursor, 0, static_cast<std::uint32_t>(saved[i].size()),
+                                 saved[i].data());
         if (slot.cursor != nullptr)
             eng::sqlite3BtreeCloseCursor(slot.cursor);
         slot.cursor = nullptr;

@@ -43,36 +43,34 @@ struct IntFace {
     }
 };
 
-struct BytesFace {
-    using Table = kovpager::BytesTable;
-    static constexpr bool kHasData = true;
+// The byte-string keys both byte tables use.
+struct TextKeys {
     static std::string key(int n) { return textKey(n); }
     static std::string keyAfter(int n) { return textKey(n) + "!"; }
-    static void put(Table& t, int n, const std::string& data) { t.put(key(n), data); }
-    static std::optional<std::string> get(Table& t, int n) { return t.get(key(n)); }
-    static std::optional<std::string_view> getView(Table& t, int n) { return t.get_view(key(n)); }
     template <typename Entry>
     static int number(const Entry& e) {
         return std::stoi(std::string(e.key().substr(1)));
     }
 };
 
+struct BytesFace : TextKeys {
+    using Table = kovpager::BytesTable;
+    static constexpr bool kHasData = true;
+    static void put(Table& t, int n, const std::string& data) { t.put(key(n), data); }
+    static std::optional<std::string> get(Table& t, int n) { return t.get(key(n)); }
+    static std::optional<std::string_view> getView(Table& t, int n) { return t.get_view(key(n)); }
+};
+
 // Key-only: a present key reads as empty data.
-struct IndexFace {
+struct IndexFace : TextKeys {
     using Table = kovpager::IndexTable;
     static constexpr bool kHasData = false;
-    static std::string key(int n) { return textKey(n); }
-    static std::string keyAfter(int n) { return textKey(n) + "!"; }
     static void put(Table& t, int n, const std::string&) { t.put(key(n)); }
     static std::optional<std::string> get(Table& t, int n) {
         return t.contains(key(n)) ? std::optional<std::string>("") : std::nullopt;
     }
     static std::optional<std::string_view> getView(Table& t, int n) {
         return t.contains(key(n)) ? std::optional<std::string_view>("") : std::nullopt;
-    }
-    template <typename Entry>
-    static int number(const Entry& e) {
-        return std::stoi(std::string(e.key().substr(1)));
     }
 };
 
